@@ -1,0 +1,161 @@
+// The firewall agent: per-filter context, installed rules, applying and
+// exporting rulesets, lookup, the packet path and the filter ioctl protocol.
+//
+// Locking: FWFilterContext::configLock ("slcg.fw.config", reader/writer,
+// rank 4) guards every field of the context and every installed rule entry.
+// It is always the last lock taken. The packet path holds it shared for a
+// whole list; rulesets are applied and rules cleared under it exclusively,
+// so no packet sees a half-applied ruleset. Counters are plain 64-bit adds
+// under the shared hold, so concurrent walks may lose an increment.
+#pragma once
+
+#include "agent/agent.h"
+#include "firewall/fw_types.h"
+
+// One installed rule, in the exact-rule table or the general-rule list.
+struct FWRuleEntry {
+  ListLinks link;              // first: the host table expects it at offset 0
+  uint32_t hash;               // low 32 bits of the tuple hash (exact rules)
+  FWRule rule;                 // version-8 form, counters included
+  ZelSocket greSocket;
+  uint8_t greSocketOpen;       // 1 once greSocket is open
+  uint16_t poolTag;            // resource-pool tag of action 8, else 0
+};
+static_assert(offsetof(FWRuleEntry, link) == 0);
+
+struct FWFilterContext {
+  SLCGenericFilter* filter;
+  ZelLock* configLock;         // rank 4, reader/writer; guards all below
+  Hash_Table* ruleHash;        // exact rules; null = no ruleset in force
+  ListLinks ruleList;          // general rules; front = newest, back = first in order
+  uint32_t defaultAction;      // SLCGenericActionEnum, fixed for the filter's life
+  uint32_t spAttachState;      // copy of the filter's, for the packet path
+  uint32_t fragOverride;       // SLCGenericActionEnum, 0 = none
+  uint32_t version;            // version of the ruleset in force
+  uint32_t fwFeatures;
+  uint32_t numRules;           // installed entries, exact and general
+  uint32_t ioctl;              // 1 once a ruleset came by an ioctl road; never cleared
+};
+
+inline FWFilterContext* FWContext(SLCGenericFilter* filter) {
+  return static_cast<FWFilterContext*>(filter->agentPriv);
+}
+
+// The firewall agent's operations table.
+extern const SLCGenericAgentOps slcGenericFwFastPathOps;
+
+// --- Filter context ---------------------------------------------------------
+
+[[nodiscard]] ZelStatus FWCreateFilter(SLCGenericFilter* filter);
+[[nodiscard]] ZelStatus FWDestroyFilter(SLCGenericFilter* filter);
+void FWConfigurationChanged(SLCGenericFilter* filter);
+void FWSpAttachStateChanged(SLCGenericFilter* filter);
+
+// --- Ruleset format ---------------------------------------------------------
+
+// 259 for version 7, 281 for version 8; ZEL_BAD_PARAM otherwise (size untouched).
+[[nodiscard]] ZelStatus FWGetRuleSize(uint32_t version, uint64_t* size);
+// Address of record `index`; null for an unsupported version.
+uint8_t* FWGetRuleFromRuleset(uint32_t version, FWRuleset* ruleset, uint32_t index, uint64_t* size);
+void FWUpdateWildcardsToCurrent(uint32_t version, FWRule* rule);
+void FWRevertWildcardsToOriginal(uint32_t version, FWRule* rule);
+inline uint8_t* FWRulesetRules(FWRuleset* ruleset) {
+  return reinterpret_cast<uint8_t*>(ruleset) + FW_RULESET_HEADER_SIZE;
+}
+
+// --- Tuples and tables (configLock held) -------------------------------------
+
+struct FWRulesetCopyState {
+  Hash_Table* target;
+  uint8_t failed;
+};
+
+uint64_t FWCreateTupleFromRule(const FWRule* rule, FWRuleTuple* tuple);
+// 0 when the entry's rule equals the tuple, 1 otherwise.
+int FWRuleCompare(const FWRuleEntry* entry, const FWRuleTuple* tuple);
+[[nodiscard]] ZelStatus FWInsertRuleInHashTable(SLCGenericFilter* filter, const FWRule* rule,
+                                                FWRuleEntry** entry);
+void FWRuleEntryFree(FWRuleEntry* entry);
+void FWDestroyHash(Hash_Table** table);
+// A table for n rules (at least 256 buckets, four per rule).
+Hash_Table* FWAllocRuleHash(uint32_t n);
+bool FWIterFreeElement(void* entry, void* table);
+bool FWIterFreeCopy(void* entry, void* table);
+bool FWIterCopyElement(void* entry, void* copyState);
+bool FWIterRulesetGet(void* entry, void* ruleset);
+
+// --- Applying and exporting (configLock held) --------------------------------
+
+// Installs `ruleset`, replacing or adding to the rules in force, all or
+// nothing. The caller guarantees the header and all numRules records of its
+// version are readable.
+[[nodiscard]] ZelStatus FWApplyRuleset(SLCGenericFilter* filter, FWRuleset* ruleset,
+                                       uint32_t replace, uint32_t fromIoctl);
+// Writes the rules in force; the buffer holds 15 + 281 * numRules bytes.
+void FWPopulateRuleset(FWFilterContext* ctx, FWRuleset* ruleset);
+void FWClearRules(FWFilterContext* ctx);
+
+// --- Lookup (configLock held shared) ----------------------------------------
+
+// The parse result of one packet. Only presence and vlan1QTag are reset per
+// packet; a field means something only while its presence bit is set.
+struct FWPktSummary {
+  uint32_t presence;
+  const uint8_t* dMac;
+  const uint8_t* sMac;
+  uint8_t ethType[2];
+  uint8_t vlan1QTag[4];
+  const uint8_t* ipSa;
+  const uint8_t* ipDa;
+  uint8_t ipProto;
+  uint8_t sPort[2];
+  uint8_t dPort[2];
+};
+
+inline constexpr uint32_t FW_PKT_L2 = 0xfu;              // bits 0-3
+inline constexpr uint32_t FW_PKT_L3 = 0x70u;             // bits 4-6
+inline constexpr uint32_t FW_PKT_PORTS = 0x180u;         // bits 7-8
+inline constexpr uint32_t FW_PKT_RPTAG = 0x200u;         // bit 9
+inline constexpr uint32_t FW_PKT_IPV4 = 1u << 20;
+inline constexpr uint32_t FW_PKT_IPV6 = 1u << 21;
+inline constexpr uint32_t FW_PKT_FIRST_FRAG = 1u << 22;
+inline constexpr uint32_t FW_PKT_LATER_FRAG = 1u << 23;
+inline constexpr uint32_t FW_PKT_TCP = 1u << 24;
+inline constexpr uint32_t FW_PKT_UDP = 1u << 25;
+
+// Exact probe: the entry whose tuple equals the packet's and which accepts
+// the packet's direction and resource-pool tag, or null.
+FWRuleEntry* FWFindExactRule(FWFilterContext* ctx, const FWRuleTuple* tuple, uint64_t hash,
+                             uint32_t direction, ZelPkt* pkt);
+// General scan in ruleset order; the first matching entry, or null.
+FWRuleEntry* FWFindRuleForPacket(SLCGenericFilter* filter, ZelPkt* pkt, uint32_t direction,
+                                 const FWPktSummary* summary);
+
+// --- Packet path ---------------------------------------------------------------
+
+[[nodiscard]] ZelStatus FWProcessPackets(SLCGenericFilter* filter, ZelPktList* list,
+                                         uint32_t direction);
+[[nodiscard]] ZelStatus FWProcessSlowPathPackets(SLCGenericFilter* filter, ZelPktList* list,
+                                                 uint32_t direction);
+uint32_t FWProcessFeatures(FWFilterContext* ctx, ZelPkt* pkt, const FWPktSummary* summary,
+                           uint32_t direction);
+// Frame bytes [start, end) when they lie within one scatter-gather element.
+const uint8_t* SLCGenericFindSGEntry(ZelPkt* pkt, uint32_t start, uint32_t end);
+// The no-ruleset path: called with configLock held shared and ruleHash null;
+// releases the lock.
+[[nodiscard]] ZelStatus FWProcessDefaultAction(FWFilterContext* ctx, ZelPktList* list,
+                                               uint32_t direction);
+
+// --- Filter ioctl protocol ------------------------------------------------------
+
+void FWFilterIoctlRequest(SLCGenericFilter* filter, uint32_t requestCode, void* payload,
+                          uint64_t payloadLen);
+// Takes configLock exclusively and applies `ruleset` with fromIoctl = 1.
+[[nodiscard]] ZelStatus FWSetIoctlRuleset(SLCGenericFilter* filter, FWRuleset* ruleset,
+                                          uint32_t replace);
+
+// --- Saved state ----------------------------------------------------------------
+
+uint32_t FWGetSavedStateLen(SLCGenericFilter* filter);
+void FWSaveState(SLCGenericFilter* filter, void* dst, uint32_t room);
+[[nodiscard]] ZelStatus FWRestoreState(SLCGenericFilter* filter, const void* src, uint64_t len);

@@ -1,0 +1,156 @@
+// Agents: the create-agent property's splitting, creation in order, repeats,
+// and creation failing at each of its steps.
+
+#include "control/control.h"
+#include "module/module.h"
+#include "tests/support/module_fixture.h"
+
+namespace {
+
+using testsupport::ModuleTest;
+
+std::vector<std::string> AgentNames() {
+  std::vector<std::string> names;
+  for (ListLinks* l = agentList.next; l != &agentList; l = l->next) {
+    names.push_back(SLCGenericAgentFromLink(l)->name);
+  }
+  return names;
+}
+
+using AgentProperty = ModuleTest;
+
+TEST_F(AgentProperty, CreatesEachNameInOrderAndSkipsRepeats) {
+  EXPECT_EQ(CreateAgents("alpha beta"), ZEL_OK);
+  EXPECT_EQ(AgentNames(),
+            (std::vector<std::string>{"sluice-generic-quelmar", "alpha", "beta"}));
+  EXPECT_TRUE(host::Sluice::AgentRegistered("alpha"));
+  EXPECT_TRUE(host::Sluice::AgentRegistered("beta"));
+  EXPECT_EQ(host::Log::Count("Registering new fastpath 'alpha'", 1), 1u);
+
+  EXPECT_EQ(CreateAgents("alpha beta"), ZEL_OK);
+  EXPECT_EQ(host::Log::Count("Agent alpha already exists. Not recreating", 1), 1u);
+  EXPECT_EQ(host::Log::Count("Agent beta already exists. Not recreating", 1), 1u);
+  EXPECT_EQ(AgentNames().size(), 3u);
+}
+
+TEST_F(AgentProperty, EmptyPiecesCreateNothing) {
+  // A trailing space adds no piece; a leading or doubled space passes an
+  // empty piece, which is announced but creates nothing.
+  EXPECT_EQ(CreateAgents("solo "), ZEL_OK);
+  EXPECT_EQ(host::Log::Count("Registering new fastpath 'solo'"), 1u);
+  EXPECT_EQ(host::Log::CountContaining("already exists"), 0u);
+  EXPECT_EQ(host::Log::Count("Registering new fastpath ''"), 0u);
+
+  EXPECT_EQ(CreateAgents(" lead"), ZEL_OK);
+  EXPECT_EQ(host::Log::Count("Registering new fastpath ''"), 1u);
+  EXPECT_EQ(CreateAgents("x  y"), ZEL_OK);
+  EXPECT_EQ(host::Log::Count("Registering new fastpath ''"), 2u);
+  EXPECT_EQ(CreateAgents(""), ZEL_OK);
+  EXPECT_EQ(AgentNames(), (std::vector<std::string>{"sluice-generic-quelmar", "solo", "lead", "x",
+                                                    "y"}));
+}
+
+TEST_F(AgentProperty, OnlySpacesSeparate) {
+  EXPECT_EQ(CreateAgents("tab\tbed"), ZEL_OK);
+  EXPECT_EQ(AgentNames().back(), "tab\tbed");
+}
+
+TEST_F(AgentProperty, ConfigurationFollowsTheFirstColon) {
+  EXPECT_EQ(CreateAgents("dropper:default-action=ACTION_DROP:x"), ZEL_OK);
+  SLCGenericFastPath* fp = Agent("dropper");
+  ASSERT_NE(fp, nullptr);
+  EXPECT_STREQ(fp->namePtr, "dropper");
+  EXPECT_STREQ(fp->configPtr, "default-action=ACTION_DROP:x");
+  EXPECT_EQ(Ctx(CreateFilter("dropper"))->defaultAction, SLCGenericActionDrop);
+
+  // A repeat compares only the name and changes nothing.
+  EXPECT_EQ(CreateAgents("dropper:default-action=ACTION_PUNT"), ZEL_OK);
+  EXPECT_STREQ(fp->configPtr, "default-action=ACTION_DROP:x");
+  EXPECT_EQ(host::Log::Count("Agent dropper already exists. Not recreating"), 1u);
+}
+
+TEST_F(AgentProperty, StopsAtFirstFailureKeepingEarlierAgents) {
+  host::Faults::Fail("zel_SluiceRegisterFastPath", ZEL_FAILURE, 2);
+  EXPECT_EQ(CreateAgents("one two three"), ZEL_FAILURE);
+  EXPECT_EQ(AgentNames(), (std::vector<std::string>{"sluice-generic-quelmar", "one"}));
+  EXPECT_EQ(host::Log::Count("Registering new fastpath 'three'"), 0u);
+}
+
+TEST_F(AgentProperty, NamesAreCutToFit) {
+  std::string longName(150, 'n');
+  EXPECT_EQ(CreateAgents(longName + ":" + std::string(200, 'c')), ZEL_OK);
+  EXPECT_EQ(AgentNames().back(), std::string(99, 'n'));
+  EXPECT_EQ(std::string(Agent(std::string(99, 'n'))->configPtr), std::string(127, 'c'));
+}
+
+TEST_F(AgentProperty, BufferRefused) {
+  host::Faults::Fail("zel_HeapAllocWithRA", ZEL_NO_MEMORY);
+  EXPECT_EQ(CreateAgents("nobuf"), ZEL_FAILURE);
+  EXPECT_TRUE(host::Log::Contains("Failed to allocate memory for agent names", 2));
+  EXPECT_EQ(AgentNames().size(), 1u);
+}
+
+struct CreationFailure {
+  const char* call;
+  ZelStatus expected;
+  const char* message;
+};
+
+class AgentCreationFailure : public ModuleTest,
+                             public ::testing::WithParamInterface<CreationFailure> {};
+
+TEST_P(AgentCreationFailure, UndoesWhatItDid) {
+  const CreationFailure& f = GetParam();
+  host::Faults::Fail(f.call, ZEL_FAILURE);
+  char text[] = "failing";
+  EXPECT_EQ(SLCGenericInitFastPathAgent(text), f.expected);
+  EXPECT_EQ(AgentNames(), std::vector<std::string>{"sluice-generic-quelmar"});
+  EXPECT_FALSE(host::Sluice::AgentRegistered("failing"));
+  EXPECT_FALSE(host::CharDevs::Registered("failing"));
+  EXPECT_TRUE(host::Log::Contains(f.message, 2)) << f.message;
+}
+
+INSTANTIATE_TEST_SUITE_P(
+    EachStep, AgentCreationFailure,
+    ::testing::Values(
+        CreationFailure{"zel_HeapAllocWithRA", ZEL_NO_MEMORY,
+                        "Failed to allocate memory for fast path agent"},
+        CreationFailure{"zel_SpinlockCreate", ZEL_FAILURE,
+                        "Failed to create lock (0xbad0001): Failure"},
+        CreationFailure{"zel_SluiceRegisterFastPath", ZEL_FAILURE,
+                        "Failed to register agent (0xbad0001): Failure"},
+        CreationFailure{"zel_CharDevRegister", ZEL_FAILURE,
+                        "Failed to register agent (0xbad0001): Failure"}));
+
+TEST_F(ModuleTest, PropertyFailureKeepsTheAgent) {
+  host::Faults::Fail("zel_SluicePropertyRegister", ZEL_FAILURE);
+  char text[] = "noprop";
+  EXPECT_EQ(SLCGenericInitFastPathAgent(text), ZEL_OK);
+  EXPECT_EQ(AgentNames().back(), "noprop");
+  EXPECT_EQ(Agent("noprop")->rulesetProp, nullptr);
+  EXPECT_FALSE(host::Sluice::PropertyRegistered("noprop.ruleset"));
+}
+
+TEST_F(ModuleTest, EmptyNameCreatesNothingSilently) {
+  host::Log::Clear();
+  char text[] = ":default-action=ACTION_DROP";
+  EXPECT_EQ(SLCGenericInitFastPathAgent(text), ZEL_OK);
+  EXPECT_EQ(SLCGenericInitFastPathAgent(nullptr), ZEL_OK);
+  EXPECT_EQ(AgentNames().size(), 1u);
+  EXPECT_TRUE(host::Log::Records().empty());
+}
+
+TEST_F(ModuleTest, AgentsGoAwayOldestFirst) {
+  ASSERT_EQ(CreateAgents("second third"), ZEL_OK);
+  CreateFilter("third", "vnic-t");
+  CreateFilter("second", "vnic-s");
+  Unload();
+  std::vector<std::string> unregistered;
+  for (const host::LogRecord& r : host::Log::Records()) {
+    if (r.text == "Unregistering ruleset property handler") unregistered.push_back(r.object);
+  }
+  EXPECT_EQ(unregistered,
+            (std::vector<std::string>{"sluice-generic-quelmar", "second", "third"}));
+}
+
+}  // namespace

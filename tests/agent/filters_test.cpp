@@ -1,0 +1,185 @@
+// Filter records: configuration reads, creation failing at each step,
+// destruction while requests are in flight, and garbage on every callback.
+
+#include "migration/migration.h"
+#include <cstring>
+
+#include "tests/support/module_fixture.h"
+
+namespace {
+
+using testsupport::kDefaultAgent;
+using testsupport::ModuleTest;
+
+using Filters = ModuleTest;
+
+TEST_F(Filters, ReadsItsConfiguration) {
+  host::FilterConfig config;
+  config.name = "vnic7";
+  config.failurePolicy = 1;
+  config.vmUUID = "4229a8e0-uuid";
+  config.vnicIndex = 3;
+  host::FilterId id = CreateFilter(kDefaultAgent, config);
+  SLCGenericFilter* f = Filter(id);
+  EXPECT_STREQ(f->name, "vnic7");
+  EXPECT_EQ(f->failurePolicy, 1u);
+  EXPECT_EQ(f->endPointType, 0u);
+  EXPECT_STREQ(f->vmUUID, "4229a8e0-uuid");
+  EXPECT_EQ(f->vnicIndex, 3u);
+  EXPECT_EQ(f->refCount, 1u);
+  EXPECT_EQ(f->spAttachState, SLCGenericSpDetached);
+  EXPECT_EQ(f->migrationState, SLCGenericStateIdle);
+  EXPECT_EQ(f->fastPath, Agent());
+}
+
+TEST_F(Filters, OtherEndpointsHaveNoVmOrVnic) {
+  host::FilterConfig config;
+  config.endPointType = 2;
+  config.vmUUID = "ignored";
+  config.vnicIndex = 5;
+  SLCGenericFilter* f = Filter(CreateFilter(kDefaultAgent, config));
+  EXPECT_STREQ(f->vmUUID, "");
+  EXPECT_EQ(f->vnicIndex, 0xFFFFFFFFu);
+}
+
+TEST_F(Filters, UnsetUuidIsNotAnError) {
+  host::FilterConfig config;
+  config.vmUUIDUnset = true;
+  config.vnicIndex = 9;
+  SLCGenericFilter* f = Filter(CreateFilter(kDefaultAgent, config));
+  EXPECT_STREQ(f->vmUUID, "");
+  EXPECT_EQ(f->vnicIndex, 9u);
+}
+
+struct ConfigFailure {
+  const char* call;
+  const char* message;
+  bool namesFilter;
+};
+
+class ConfigReadFailure : public ModuleTest, public ::testing::WithParamInterface<ConfigFailure> {};
+
+TEST_P(ConfigReadFailure, CancelsTheFilter) {
+  const ConfigFailure& f = GetParam();
+  host::Faults::Fail(f.call, ZEL_FAILURE);
+  host::FilterId id = 0;
+  EXPECT_EQ(host::Sluice::CreateFilter(kDefaultAgent, {}, &id), ZEL_FAILURE);
+  EXPECT_TRUE(List_IsEmpty(&Agent()->filters));
+  std::vector<host::LogRecord> records = host::Log::Records();
+  auto it = std::find_if(records.begin(), records.end(),
+                         [&](const host::LogRecord& r) { return r.text == f.message; });
+  ASSERT_NE(it, records.end()) << f.message;
+  EXPECT_EQ(it->urgency, 2);
+  EXPECT_EQ(it->object, f.namesFilter ? "vnic0" : "");
+}
+
+INSTANTIATE_TEST_SUITE_P(
+    EachQuery, ConfigReadFailure,
+    ::testing::Values(
+        ConfigFailure{"zel_SluiceGetName", "Could not get filter name (0xbad0001): Failure", false},
+        ConfigFailure{"zel_SluiceGetFailurePolicy",
+                      "Could not get filter failure policy (0xbad0001): Failure", true},
+        ConfigFailure{"zel_SluiceGetEndPointType",
+                      "Could not get filter endpoint type (0xbad0001): Failure", true},
+        ConfigFailure{"zel_SluiceGetVMUUID", "Could not get filter vm uuid (0xbad0001): Failure",
+                      true},
+        ConfigFailure{"zel_SluiceGetVnicIndex",
+                      "Could not get filter vnic index (0xbad0001): Failure", true}));
+
+TEST_F(Filters, CreationFailuresFreeEverything) {
+  host::FilterId id = 0;
+  host::Faults::Fail("zel_HeapAllocWithRA", ZEL_NO_MEMORY);
+  EXPECT_EQ(host::Sluice::CreateFilter(kDefaultAgent, {}, &id), ZEL_NO_MEMORY);
+  EXPECT_TRUE(host::Log::Contains("Failed to allocate memory for filter", 1));
+
+  // The filter lock, then the firewall's configuration lock.
+  host::Faults::Fail("zel_SpinlockCreate", ZEL_FAILURE);
+  EXPECT_EQ(host::Sluice::CreateFilter(kDefaultAgent, {}, &id), ZEL_FAILURE);
+  host::Faults::Fail("zel_SpinlockCreate", ZEL_FAILURE, 2);
+  EXPECT_EQ(host::Sluice::CreateFilter(kDefaultAgent, {}, &id), ZEL_FAILURE);
+  EXPECT_TRUE(host::Log::Contains("Could not allocate configuration lock", 2));
+
+  // The record, then the firewall context.
+  host::Faults::Fail("zel_HeapAllocWithRA", ZEL_NO_MEMORY, 2);
+  EXPECT_EQ(host::Sluice::CreateFilter(kDefaultAgent, {}, &id), ZEL_NO_MEMORY);
+  EXPECT_TRUE(host::Log::Contains("Failed to allocate memory for agent context", 2));
+
+  EXPECT_TRUE(List_IsEmpty(&Agent()->filters));
+}
+
+TEST_F(Filters, ListedInOrderOfCreation) {
+  host::FilterId a = CreateFilter(kDefaultAgent, "a");
+  host::FilterId b = CreateFilter(kDefaultAgent, "b");
+  host::FilterId c = CreateFilter(kDefaultAgent, "c");
+  ASSERT_EQ(host::Sluice::DestroyFilter(b), ZEL_OK);
+  std::vector<SLCGenericFilter*> listed;
+  for (ListLinks* l = Agent()->filters.next; l != &Agent()->filters; l = l->next) {
+    listed.push_back(SLCGenericFilterFromLink(l));
+  }
+  EXPECT_EQ(listed, (std::vector<SLCGenericFilter*>{Filter(a), Filter(c)}));
+}
+
+TEST_F(Filters, DestroyIsBusyWhileAReplyIsOutstanding) {
+  host::FilterId id = CreateFilter();
+  host::Sluice::SetPolicy(host::RequestKind::SetSlowPath, testsupport::Replies(host::ReplyMode::Deferred));
+  ASSERT_EQ(host::Sluice::RegisterSlowPath(kDefaultAgent, 1), ZEL_OK);
+  host::Timers::RunDue();
+  ASSERT_EQ(Filter(id)->spAttachState, SLCGenericSpAttaching);
+
+  EXPECT_EQ(host::Sluice::DestroyFilter(id), ZEL_BUSY);
+  EXPECT_FALSE(List_IsEmpty(&Agent()->filters));
+
+  EXPECT_EQ(host::Sluice::ReleaseReplies(host::RequestKind::SetSlowPath), 1u);
+  EXPECT_EQ(Filter(id)->spAttachState, SLCGenericSpAttached);
+  EXPECT_EQ(host::Sluice::DestroyFilter(id), ZEL_OK);
+  EXPECT_TRUE(host::Log::Contains("Detaching from slow path #1", 1));
+}
+
+TEST_F(Filters, ConfigurationChangeRereadsOnlyTheRecord) {
+  host::FilterId id = CreateFilter();
+  FWFilterContext before = *Ctx(id);
+  host::FilterConfig config;
+  config.name = "renamed";
+  config.failurePolicy = 1;
+  host::Sluice::SetFilterConfig(id, config);
+  host::Sluice::ConfigurationChanged(id);
+  EXPECT_STREQ(Filter(id)->name, "renamed");
+  EXPECT_EQ(Filter(id)->failurePolicy, 1u);
+  EXPECT_EQ(std::memcmp(&before, Ctx(id), sizeof(before)), 0);
+}
+
+// A record-shaped block of garbage: every callback must look at its first
+// eight bytes only.
+TEST_F(ModuleTest, GarbageOnEveryCallbackIsRefused) {
+  alignas(16) uint8_t garbage[512];
+  std::memset(garbage, 0x5a, sizeof(garbage));
+  std::vector<uint8_t> before(garbage, garbage + sizeof(garbage));
+  host::PacketList list;
+  list.Append(host::Packets::Make(std::vector<uint8_t>(64, 1)));
+  void* priv = nullptr;
+  uint64_t len = 0;
+
+  EXPECT_EQ(slcGenericOps.registerSlowPath(garbage, 1, &priv), ZEL_BAD_PARAM);
+  EXPECT_EQ(slcGenericOps.createFilter(garbage, nullptr, &priv, 0), ZEL_BAD_PARAM);
+  EXPECT_EQ(slcGenericOps.destroyFilter(garbage), ZEL_OK);
+  EXPECT_EQ(slcGenericOps.unregisterSlowPath(garbage), ZEL_OK);
+  EXPECT_EQ(slcGenericOps.processPackets(garbage, list.get(), 1), ZEL_BAD_PARAM);
+  EXPECT_EQ(slcGenericOps.processSlowPathPackets(garbage, list.get(), 1), ZEL_BAD_PARAM);
+  slcGenericOps.processFilterIoctl(garbage, 1, garbage, 8);
+  slcGenericOps.processSlowPathIoctl(garbage, 1, garbage, 8);
+  slcGenericOps.configurationChanged(garbage);
+  slcGenericOps.prefetchSavedState(garbage);
+  EXPECT_EQ(slcGenericOps.getSavedStateLen(garbage, &len), ZEL_BAD_PARAM);
+  EXPECT_EQ(slcGenericOps.saveState(garbage, garbage, &len), ZEL_BAD_PARAM);
+  EXPECT_EQ(slcGenericOps.restoreState(garbage, garbage, 64), ZEL_BAD_PARAM);
+  SLCGenericSetSlowPathReply(garbage, garbage, ZEL_OK);
+  SLCGenericAttachSlowPathsToFilters(garbage);
+
+  EXPECT_EQ(std::vector<uint8_t>(garbage, garbage + sizeof(garbage)), before);
+  EXPECT_EQ(list.Count(), 1u);
+  EXPECT_GE(host::Log::Count("Bad magic for filter", 2), 8u);
+  EXPECT_EQ(host::Log::Count("Bad magic for fastPath", 2), 3u);
+  EXPECT_EQ(host::Log::Count("Bad magic for slowPath", 2), 2u);
+}
+
+}  // namespace

@@ -1,0 +1,126 @@
+#include "tests/support/fw_fixture.h"
+
+#include "module/module.h"
+
+namespace testsupport {
+
+void FirewallTest::SetUp() {
+  ModuleTest::SetUp();
+  id_ = CreateFilter();
+  filter_ = Filter(id_);
+  ASSERT_NE(filter_, nullptr);
+  ctx_ = Ctx(id_);
+  ASSERT_NE(ctx_, nullptr);
+}
+
+void FirewallTest::TearDown() {
+  for (auto& [tag, pkt] : tagPackets_) zel_PktRelease(pkt);
+  tagPackets_.clear();
+  ModuleTest::TearDown();
+}
+
+ZelStatus FirewallTest::Apply(const std::vector<uint8_t>& ruleset, bool replace, bool fromIoctl) {
+  // The module may read the header through a pointer to FWRuleset; give it
+  // a private copy so a read past the records shows up under ASan.
+  std::vector<uint8_t> copy(ruleset);
+  SLCGenericWriteGuard guard(ctx_->configLock);
+  return FWApplyRuleset(filter_, reinterpret_cast<FWRuleset*>(copy.data()), replace ? 1 : 0,
+                        fromIoctl ? 1 : 0);
+}
+
+std::vector<uint8_t> FirewallTest::Populate() {
+  SLCGenericReadGuard guard(ctx_->configLock);
+  std::vector<uint8_t> buf(FW_RULESET_HEADER_SIZE + size_t{FW_RULE_SIZE_V8} * ctx_->numRules);
+  FWPopulateRuleset(ctx_, reinterpret_cast<FWRuleset*>(buf.data()));
+  FWRulesetHeader h;
+  std::memcpy(&h, buf.data(), sizeof(h));
+  uint64_t size = 0;
+  EXPECT_EQ(FWGetRuleSize(h.version, &size), ZEL_OK);
+  buf.resize(FW_RULESET_HEADER_SIZE + size * h.numRules);
+  return buf;
+}
+
+void FirewallTest::Clear() {
+  SLCGenericWriteGuard guard(ctx_->configLock);
+  FWClearRules(ctx_);
+}
+
+std::vector<FWRuleEntry*> FirewallTest::ExactEntries() {
+  std::vector<FWRuleEntry*> out;
+  Hash_Table* t = ctx_->ruleHash;
+  if (t == nullptr) return out;
+  for (uint32_t b = 0; b < t->numBuckets; b++) {
+    ListLinks* head = &t->buckets[b];
+    for (ListLinks* l = head->prev; l != head; l = l->prev) {
+      out.push_back(reinterpret_cast<FWRuleEntry*>(l));
+    }
+  }
+  return out;
+}
+
+std::vector<FWRuleEntry*> FirewallTest::GeneralEntries() {
+  std::vector<FWRuleEntry*> out;
+  for (ListLinks* l = ctx_->ruleList.prev; l != &ctx_->ruleList; l = l->prev) {
+    out.push_back(reinterpret_cast<FWRuleEntry*>(l));
+  }
+  return out;
+}
+
+FWRuleEntry* FirewallTest::FindExact(const FWRule& rule) {
+  for (FWRuleEntry* e : ExactEntries()) {
+    if (FwModel::SameKey(e->rule, rule)) return e;
+  }
+  return nullptr;
+}
+
+ZelPkt* FirewallTest::PacketWithTag(uint16_t tag) {
+  auto it = tagPackets_.find(tag);
+  if (it != tagPackets_.end()) return it->second;
+  host::PacketSpec spec;
+  spec.frame.assign(64, 0);
+  spec.resPoolTag = tag;
+  ZelPkt* pkt = host::Packets::Make(spec);
+  tagPackets_[tag] = pkt;
+  return pkt;
+}
+
+FWRuleEntry* FirewallTest::Lookup(const ModelPacket& pkt, uint32_t direction, uint16_t poolTag) {
+  ZelPkt* hostPkt = PacketWithTag(poolTag);
+  const FWPktSummary summary = pkt.Summary();
+  SLCGenericReadGuard guard(ctx_->configLock);
+  if (summary.presence & FW_PKT_PORTS) {
+    FWRuleTuple tuple;
+    const uint64_t hash = pkt.Tuple(&tuple);
+    if (FWRuleEntry* e = FWFindExactRule(ctx_, &tuple, hash, direction, hostPkt)) return e;
+  }
+  return FWFindRuleForPacket(filter_, hostPkt, direction, &summary);
+}
+
+FirewallTest::Fingerprint FirewallTest::Capture() {
+  Fingerprint f{};
+  f.ruleHash = ctx_->ruleHash;
+  f.fragOverride = ctx_->fragOverride;
+  f.version = ctx_->version;
+  f.fwFeatures = ctx_->fwFeatures;
+  f.numRules = ctx_->numRules;
+  f.ioctl = ctx_->ioctl;
+  f.populated = Populate();
+  for (FWRuleEntry* e : ExactEntries()) {
+    f.entryOwnership.push_back({reinterpret_cast<uintptr_t>(e), e->poolTag, e->greSocket,
+                                e->greSocketOpen, e->hash});
+  }
+  for (FWRuleEntry* e : GeneralEntries()) {
+    f.entryOwnership.push_back({reinterpret_cast<uintptr_t>(e), e->poolTag, e->greSocket,
+                                e->greSocketOpen});
+  }
+  f.heapBlocks = host::Heaps::Stats(slcGenericHeapID).blocks;
+  f.poolTags = host::ResPools::OutstandingTotal();
+  f.sockets = host::Sockets::Open();
+  return f;
+}
+
+bool SameRecord(const FWRule& a, const FWRule& b) {
+  return std::memcmp(&a, &b, sizeof(FWRule)) == 0;
+}
+
+}  // namespace testsupport
