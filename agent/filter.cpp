@@ -123,8 +123,13 @@ ZelStatus SLCGenericDestroyFilter(void* filterPriv) {
     SLCGenericSpinGuard agentGuard(fp->lock);
     SLCGenericSpinGuard filterGuard(filter->lock);
     if (filter->spAttachState == SLCGenericSpAttached) {
-      // Destruction goes on whatever the detach answers.
-      (void)SLCGenericDetachSlowPath(filter);
+      // A clear that failed transiently leaves the filter attached and
+      // counted by its slow path; freeing it now would leave that count
+      // raised for good and the slow path could never go. The framework
+      // calls destroy again, which retries the clear.
+      if (SLCGenericDetachSlowPath(filter) != ZEL_OK) {
+        return ZEL_BUSY;
+      }
     }
     if (filter->refCount > 1) {
       return ZEL_BUSY;
