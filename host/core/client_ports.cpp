@@ -73,11 +73,14 @@ ZelStatus ClientPorts::Write(std::string_view name, std::string_view text) {
     PortState& p = P();
     std::lock_guard<std::mutex> g(p.mu);
     auto it = p.byName.find(name);
-    if (it == p.byName.end()) Fatal("ClientPorts::Write: no client port %.*s", static_cast<int>(name.size()), name.data());
+    if (it == p.byName.end()) {
+      Fatal("ClientPorts::Write: no client port %.*s", static_cast<int>(name.size()), name.data());
+    }
     ops = it->second->ops;
   }
   if (ops->write == nullptr) {
-    Fatal("ClientPorts::Write: client port %.*s has no write handler", static_cast<int>(name.size()), name.data());
+    Fatal("ClientPorts::Write: client port %.*s has no write handler", static_cast<int>(name.size()),
+          name.data());
   }
   // The handler may cut the text in place; it gets its own copy, exactly
   // `len` bytes long with no terminator, as the switch would hand it over.

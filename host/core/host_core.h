@@ -99,6 +99,7 @@ struct LogRecord {
 
 class Log {
  public:
+  // Records since the last Clear or Reset (at most the latest 200000).
   static std::vector<LogRecord> Records();
   // Records whose text equals `text` (urgency -1 = any).
   static size_t Count(std::string_view text, int32_t urgency = -1);

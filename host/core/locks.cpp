@@ -198,7 +198,9 @@ namespace core {
 
 void PushPseudoLock(uint32_t rank, const char* what) {
   const HeldStack& hs = tHeld;
-  if (hs.depth != 0 && rank <= hs.entries[hs.depth - 1].rank) RankViolation(what, rank, hs.entries[hs.depth - 1]);
+  if (hs.depth != 0 && rank <= hs.entries[hs.depth - 1].rank) {
+    RankViolation(what, rank, hs.entries[hs.depth - 1]);
+  }
   Push(nullptr, what, rank, kPseudo);
 }
 
@@ -237,7 +239,9 @@ void LockLeftovers(std::vector<std::string>* out) {
   LockRegistry& r = R();
   std::lock_guard<std::mutex> g(r.mu);
   std::vector<std::string> names;
-  for (ZelLock* l : r.locks) names.push_back("lock " + l->name + " (rank " + std::to_string(l->rank) + "): still exists");
+  for (ZelLock* l : r.locks) {
+    names.push_back("lock " + l->name + " (rank " + std::to_string(l->rank) + "): still exists");
+  }
   std::sort(names.begin(), names.end());
   out->insert(out->end(), names.begin(), names.end());
   for (auto& [id, d] : r.domains) out->push_back("lock domain " + d.name + ": still exists");
@@ -314,7 +318,9 @@ void zel_LockDomainDestroy(ZelLockDomainID domain) {
   host::LockRegistry& r = host::R();
   std::lock_guard<std::mutex> g(r.mu);
   auto it = r.domains.find(domain);
-  if (it == r.domains.end()) host::Fatal("zel_LockDomainDestroy: no lock domain %lld", static_cast<long long>(domain));
+  if (it == r.domains.end()) {
+    host::Fatal("zel_LockDomainDestroy: no lock domain %lld", static_cast<long long>(domain));
+  }
   if (it->second.liveLocks != 0) {
     std::string names;
     for (ZelLock* l : r.locks) {
@@ -353,7 +359,9 @@ void zel_SpinlockDestroy(ZelLock* lock) {
   if (lock == nullptr) return;
   host::LockRegistry& r = host::R();
   std::lock_guard<std::mutex> g(r.mu);
-  if (r.locks.count(lock) == 0) host::Fatal("zel_SpinlockDestroy: %p is not a live lock", static_cast<void*>(lock));
+  if (r.locks.count(lock) == 0) {
+    host::Fatal("zel_SpinlockDestroy: %p is not a live lock", static_cast<void*>(lock));
+  }
   if (lock->state.load(std::memory_order_acquire) & ~ZelLock::kWriterWaiting) {
     host::Fatal("zel_SpinlockDestroy: lock %s (rank %u) is held", lock->name.c_str(), lock->rank);
   }

@@ -31,6 +31,7 @@ namespace {
 constexpr std::string_view kLongPrefix = "%s: %s:%d: ";
 constexpr std::string_view kLongObjectPrefix = "%s: %s:%d: %s: ";
 constexpr std::string_view kShortObjectPrefix = "%s: ";
+constexpr size_t kMaxRecords = 200000;
 
 struct LogState {
   std::mutex mu;
@@ -88,6 +89,11 @@ void Capture(LogRecord record) {
     if (record.rendered.empty() || record.rendered.back() != '\n') std::fputc('\n', stderr);
   }
   std::lock_guard<std::mutex> g(s.mu);
+  // Long runs (tools, benchmarks) that log per packet must not grow without
+  // bound: past the cap the older half goes.
+  if (s.records.size() >= kMaxRecords) {
+    s.records.erase(s.records.begin(), s.records.begin() + kMaxRecords / 2);
+  }
   s.records.push_back(std::move(record));
 }
 
@@ -117,7 +123,9 @@ void ReportLogsOf(ZelModuleID module) {
     LogState& s = L();
     std::lock_guard<std::mutex> g(s.mu);
     for (auto& l : s.logs) {
-      if (l->alive && l->owner == module) leaks.push_back("log " + l->name + ": not unregistered at unload");
+      if (l->alive && l->owner == module) {
+        leaks.push_back("log " + l->name + ": not unregistered at unload");
+      }
     }
   }
   for (auto& leak : leaks) RecordLeak(std::move(leak));

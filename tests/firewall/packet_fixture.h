@@ -75,13 +75,27 @@ class PacketPathTest : public testsupport::FirewallTest {
     return Run(pkts, direction);
   }
 
-  // Sets the filter's attachment state as the slow path link does and lets
-  // the firewall copy it (agent and filter locks held).
-  void SetAttachState(SLCGenericSpAttachState state) {
-    SLCGenericSpinGuard agent(filter_->fastPath->lock);
-    SLCGenericSpinGuard filter(filter_->lock);
-    filter_->spAttachState = state;
-    FWSpAttachStateChanged(filter_);
+  // Registers a slow path whose attach request is answered later: the
+  // filter stays attaching until FinishAttach().
+  void StartAttaching() {
+    host::RequestPolicy deferred;
+    deferred.mode = host::ReplyMode::Deferred;
+    host::Sluice::SetPolicy(host::RequestKind::SetSlowPath, deferred);
+    ASSERT_EQ(host::Sluice::RegisterSlowPath(testsupport::kDefaultAgent, 1), ZEL_OK);
+    host::Timers::RunDue();
+    ASSERT_EQ(ctx_->spAttachState, SLCGenericSpAttaching);
+  }
+  void FinishAttach() {
+    host::Sluice::ReleaseReplies(host::RequestKind::SetSlowPath);
+    ASSERT_EQ(ctx_->spAttachState, SLCGenericSpAttached);
+  }
+  void Attach() {
+    StartAttaching();
+    FinishAttach();
+  }
+  void TearDown() override {
+    host::Sluice::ReleaseReplies(host::RequestKind::SetSlowPath);
+    FirewallTest::TearDown();
   }
 
   // Frames of every list handed to the framework, with the direction of

@@ -100,7 +100,9 @@ class CharDevTest : public testsupport::HostTest {
     ASSERT_EQ(zel_CharDevRegister(3, "fw0", &kDevOps, 0, &devPriv, &handle_), ZEL_OK);
   }
   void TearDown() override {
-    if (CharDevs::Registered("fw0")) EXPECT_EQ(zel_CharDevUnregister(handle_), ZEL_OK);
+    if (CharDevs::Registered("fw0")) {
+      EXPECT_EQ(zel_CharDevUnregister(handle_), ZEL_OK);
+    }
     HostTest::TearDown();
   }
   DevSeen seen_;

@@ -45,7 +45,8 @@ TEST_F(LogTest, LongFormIsSplitIntoItsFields) {
   EXPECT_EQ(r[0].line, 412);
   EXPECT_EQ(r[0].object, "vm: nic0");
   EXPECT_EQ(r[0].text, "Failed to set slow path (0xbad0001): Failure");
-  EXPECT_EQ(r[0].rendered, "modlog: SLCGenericAttach:412: vm: nic0: Failed to set slow path (0xbad0001): Failure\n");
+  EXPECT_EQ(r[0].rendered,
+            "modlog: SLCGenericAttach:412: vm: nic0: Failed to set slow path (0xbad0001): Failure\n");
   EXPECT_EQ(r[1].object, "");
   EXPECT_EQ(r[1].function, "init_module");
   EXPECT_EQ(r[1].text, "Loading sluice-generic-fastpath (platform)");

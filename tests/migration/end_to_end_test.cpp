@@ -29,7 +29,9 @@ using migsupport::kVmMac;
 Bytes Version7Rules() {
   return rules::RulesetBuilder(7)
       .Features(FW_FEATURE_DROP_DHCP_SERVER)
-      .Add(ExactRule("accept", "tcp", "10.0.0.1", 1000, "10.0.0.2", 80, "bidir"))
+      .Add(ExactRule("accept", "tcp", "10.0.0.1", 1000, "10.0.0.2", 80))
+      .Add(std::string("action=accept dir=from ipv4 dmac=") + kVmMac + " smac=" + kGwMac +
+           " ethtype=0x0800 vlan=none proto=tcp sa=10.0.0.2 da=10.0.0.1 sport=80 dport=1000")
       .Add(ExactRule("drop", "udp", "10.0.0.1", 5000, "10.0.0.3", 53))
       .Add("action=punt ipv4 ethtype=0x0800 proto=tcp da=10.1.0.0-10.1.0.255")
       .Bytes();
@@ -263,7 +265,8 @@ TEST_F(MigrationEndToEndTest, DestinationContinuesWhereTheSourceStopped) {
     EXPECT_EQ(requests[i].data, vm.slowPathState);
 
     const Bytes restored = migsupport::Rules(f);
-    EXPECT_TRUE(View(restored) == View(vm.rulesAtSave));
+    EXPECT_TRUE(View(restored) == View(vm.rulesAtSave))
+        << rules::FormatRuleset(restored) << "\n---- source:\n" << rules::FormatRuleset(vm.rulesAtSave);
 
     const std::vector<Verdict> verdicts = Run(vm.id, capture);
     ASSERT_EQ(verdicts.size(), capture.size());
