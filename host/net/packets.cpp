@@ -281,7 +281,10 @@ void PacketLeftovers(std::vector<std::string>* out) {
   for (ZelPkt* pkt : reg.live) serials.push_back(pkt->serial);
   std::sort(serials.begin(), serials.end());
   std::string text = std::to_string(serials.size()) + " live packet(s), serials";
-  for (size_t i = 0; i < serials.size() && i < 16; i++) text += " " + std::to_string(serials[i]);
+  for (size_t i = 0; i < serials.size() && i < 16; i++) {
+    text += ' ';
+    text += std::to_string(serials[i]);
+  }
   if (serials.size() > 16) text += " ...";
   out->push_back(text);
 }
@@ -293,29 +296,29 @@ void PacketLeftovers(std::vector<std::string>* out) {
 // ---------------------------------------------------------------------------
 // Test-facing packet access
 
-ZelPkt* Packets::Make(const PacketSpec& spec) {
-  std::vector<uint32_t> sizes = spec.sgSizes;
-  if (sizes.empty()) sizes.push_back(static_cast<uint32_t>(spec.frame.size()));
+ZelPkt* Packets::Make(const PacketSpec& layout) {
+  std::vector<uint32_t> sizes = layout.sgSizes;
+  if (sizes.empty()) sizes.push_back(static_cast<uint32_t>(layout.frame.size()));
   uint64_t total = 0;
   for (uint32_t s : sizes) total += s;
-  if (total != spec.frame.size()) {
+  if (total != layout.frame.size()) {
     Fatal("Packets::Make: element sizes add up to %llu, frame has %zu bytes",
-          (unsigned long long)total, spec.frame.size());
+          (unsigned long long)total, layout.frame.size());
   }
   if (sizes.size() > UINT16_MAX) Fatal("Packets::Make: too many elements");
-  uint32_t mapped = spec.mappedLen == UINT32_MAX ? sizes[0] : spec.mappedLen;
+  uint32_t mapped = layout.mappedLen == UINT32_MAX ? sizes[0] : layout.mappedLen;
   if (mapped > sizes[0]) Fatal("Packets::Make: mapped length %u > element 0 (%u)", mapped, sizes[0]);
-  if (spec.vlanId > 4095 || spec.priority > 7) {
-    Fatal("Packets::Make: VLAN ID %u / priority %u out of range", spec.vlanId, spec.priority);
+  if (layout.vlanId > 4095 || layout.priority > 7) {
+    Fatal("Packets::Make: VLAN ID %u / priority %u out of range", layout.vlanId, layout.priority);
   }
-  return NewPacket(spec.frame.data(), sizes, mapped,
-                   Meta{spec.vlanId, spec.priority, spec.resPoolTag, spec.writable, 0});
+  return NewPacket(layout.frame.data(), sizes, mapped,
+                   Meta{layout.vlanId, layout.priority, layout.resPoolTag, layout.writable, 0});
 }
 
 ZelPkt* Packets::Make(std::span<const uint8_t> frame) {
-  PacketSpec spec;
-  spec.frame.assign(frame.begin(), frame.end());
-  return Make(spec);
+  PacketSpec layout;
+  layout.frame.assign(frame.begin(), frame.end());
+  return Make(layout);
 }
 
 std::vector<uint8_t> Packets::Frame(ZelPkt* pkt) {
