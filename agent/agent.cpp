@@ -30,12 +30,23 @@ void SLCGenericMagicKill(void* record) {
 
 void SLCGenericAgentListAppend(SLCGenericAgent* agent) {
   // Readers walk agentList without a lock, following next pointers from the
-  // head. The agent is complete before the store that makes it reachable.
-  ListLinks* last = agentList.prev;
+  // head; writers (the create-agent property and the status tree) may run at
+  // the same time. The agent is complete before the compare-and-swap that
+  // makes it reachable. A writer that finds the tail moved (another append
+  // won between reading prev and the swap) waits for that append to publish
+  // the new tail, which it does right after its own swap.
   agent->link.next = &agentList;
-  agent->link.prev = last;
-  agentList.prev = &agent->link;
-  __atomic_store_n(&last->next, &agent->link, __ATOMIC_RELEASE);
+  for (;;) {
+    ListLinks* last = __atomic_load_n(&agentList.prev, __ATOMIC_ACQUIRE);
+    agent->link.prev = last;
+    ListLinks* expected = &agentList;
+    if (__atomic_compare_exchange_n(&last->next, &expected, &agent->link, false,
+                                    __ATOMIC_RELEASE, __ATOMIC_RELAXED)) {
+      __atomic_store_n(&agentList.prev, &agent->link, __ATOMIC_RELEASE);
+      return;
+    }
+    __builtin_ia32_pause();
+  }
 }
 
 namespace {

@@ -98,112 +98,138 @@ uint8_t FWWalkIpv6Extensions(ZelPkt* pkt, const uint8_t* frame, uint32_t frameLe
   }
 }
 
-// Parses one frame into `s` (presence and vlan1QTag already reset by the
-// caller). `frame` holds `mappedLen` readable bytes of a `frameLen`-byte
-// frame.
-__attribute__((always_inline)) inline void FWParseFrame(ZelPkt* pkt, const uint8_t* frame, uint32_t frameLen, uint32_t mappedLen,
-                         uint32_t fragOverride, FWPktSummary* s) {
-  if (mappedLen < FW_ETH_MIN_PARSED) return;
-  s->presence |= FW_PKT_L2;
+// Byte views of the summary: ethType and vlan1QTag sit together, as do
+// ipProto, sPort and dPort, so each group moves as one block between frame,
+// summary and tuple.
+static_assert(offsetof(FWPktSummary, vlan1QTag) == offsetof(FWPktSummary, ethType) + 2);
+static_assert(offsetof(FWPktSummary, sPort) == offsetof(FWPktSummary, ipProto) + 1);
+static_assert(offsetof(FWPktSummary, dPort) == offsetof(FWPktSummary, ipProto) + 3);
+static_assert(FW_TUPLE_VLAN == FW_TUPLE_ETHTYPE + 2);
+static_assert(FW_TUPLE_V4_IPDA == FW_TUPLE_IPSA + 4);
+static_assert(FW_TUPLE_V6_IPDA == FW_TUPLE_IPSA + 16);
+static_assert(FW_TUPLE_V4_SPORT == FW_TUPLE_V4_PROTO + 1 && FW_TUPLE_V4_DPORT == FW_TUPLE_V4_PROTO + 3);
+static_assert(FW_TUPLE_V6_SPORT == FW_TUPLE_V6_PROTO + 1 && FW_TUPLE_V6_DPORT == FW_TUPLE_V6_PROTO + 3);
+
+inline uint8_t* SummaryBytes(FWPktSummary* s, size_t member) {
+  return reinterpret_cast<uint8_t*>(s) + member;
+}
+inline const uint8_t* SummaryBytes(const FWPktSummary* s, size_t member) {
+  return reinterpret_cast<const uint8_t*>(s) + member;
+}
+
+// Parses one frame into `s`. `frame` holds `mappedLen` readable bytes of a
+// `frameLen`-byte frame. Every presence bit and vlan1QTag are set afresh;
+// other fields only where their bit is set.
+__attribute__((always_inline)) inline void FWParseFrame(ZelPkt* pkt,
+                                                        const uint8_t* __restrict frame,
+                                                        uint32_t frameLen, uint32_t mappedLen,
+                                                        uint32_t fragOverride,
+                                                        FWPktSummary* __restrict s) {
+  uint32_t presence = FW_PKT_RPTAG;
+  uint32_t vlanTag = 0;
+  if (mappedLen < FW_ETH_MIN_PARSED) {
+    s->presence = presence;
+    __builtin_memcpy(s->vlan1QTag, &vlanTag, 4);
+    return;
+  }
+  // The tag comes from the packet's metadata; an 802.1Q header in the frame
+  // is only skipped by the Ethernet parse.
+  const uint16_t vlanId = zel_PktVlanIDGet(pkt);
+  const uint8_t priority = zel_PktPriorityGet(pkt);
+  if (vlanId != 0 || priority != 0) {
+    const uint8_t tag[4] = {0x81, 0x00, static_cast<uint8_t>((priority << 5) | (vlanId >> 8)),
+                            static_cast<uint8_t>(vlanId & 0xff)};
+    __builtin_memcpy(&vlanTag, tag, 4);
+  }
+  __builtin_memcpy(s->vlan1QTag, &vlanTag, 4);
+
+  presence |= FW_PKT_L2;
   s->dMac = frame;
   s->sMac = frame + 6;
   uint32_t l3;
   const uint8_t* ethType = FWEthernetParse(frame, &l3);
-  s->ethType[0] = ethType[0];
-  s->ethType[1] = ethType[1];
-
-  // The tag comes from the packet's metadata; an 802.1Q header in the
-  // frame was only skipped above.
-  const uint16_t vlanId = zel_PktVlanIDGet(pkt);
-  const uint8_t priority = zel_PktPriorityGet(pkt);
-  if (vlanId != 0 || priority != 0) {
-    s->vlan1QTag[0] = 0x81;
-    s->vlan1QTag[1] = 0x00;
-    s->vlan1QTag[2] = static_cast<uint8_t>((priority << 5) | (vlanId >> 8));
-    s->vlan1QTag[3] = static_cast<uint8_t>(vlanId & 0xff);
-  }
+  __builtin_memcpy(s->ethType, ethType, 2);
 
   const uint16_t type = FWNet16(ethType);
   uint64_t l4;
+  uint8_t proto;
   if (type == FW_ETHTYPE_IPV4) {
-    if (mappedLen < l3 + 20) return;
+    if (mappedLen < l3 + 20) {
+      s->presence = presence;
+      return;
+    }
     const uint8_t* ip = frame + l3;
-    s->presence |= FW_PKT_L3 | FW_PKT_IPV4;
+    presence |= FW_PKT_L3 | FW_PKT_IPV4;
     s->ipSa = ip + 12;
     s->ipDa = ip + 16;
-    s->ipProto = ip[9];
+    proto = ip[9];
     l4 = l3 + 4u * (ip[0] & 0x0f);  // IHL as it stands, even below 5
     const uint16_t frag = FWNet16(ip + 6);
-    if ((frag & 0x3fff) != 0) {  // more-fragments or an offset
-      s->presence |= (frag & 0x1fff) != 0 ? FW_PKT_LATER_FRAG : FW_PKT_FIRST_FRAG;
+    if (__builtin_expect((frag & 0x3fff) != 0, 0)) {  // more-fragments or an offset
+      presence |= (frag & 0x1fff) != 0 ? FW_PKT_LATER_FRAG : FW_PKT_FIRST_FRAG;
     }
   } else if (type == FW_ETHTYPE_IPV6) {
-    if (mappedLen < l3 + 40) return;
+    if (mappedLen < l3 + 40) {
+      s->presence = presence;
+      return;
+    }
     const uint8_t* ip = frame + l3;
-    s->presence |= FW_PKT_L3 | FW_PKT_IPV6;
+    presence |= FW_PKT_L3 | FW_PKT_IPV6;
     s->ipSa = ip + 8;
     s->ipDa = ip + 24;
-    const uint8_t nh = ip[6];
+    proto = ip[6];
     l4 = l3 + 40;
-    if (nh == kProtoTcp || nh == kProtoUdp) {
-      s->ipProto = nh;
-    } else {
-      s->ipProto =
-          FWWalkIpv6Extensions(pkt, frame, frameLen, mappedLen, nh, l4, &l4, &s->presence);
-      if (s->ipProto == kProtoUnparsed) return;
+    if (proto != kProtoTcp && proto != kProtoUdp) {
+      proto = FWWalkIpv6Extensions(pkt, frame, frameLen, mappedLen, proto, l4, &l4, &presence);
     }
   } else {
+    s->presence = presence;
     return;
   }
+  s->ipProto = proto;
 
   // Ports: never for a later fragment, nor for a first fragment while a
-  // fragment override decides fragments without looking at ports.
-  const uint8_t proto = s->ipProto;
-  if (proto != kProtoTcp && proto != kProtoUdp) return;
-  if (s->presence & FW_PKT_LATER_FRAG) return;
-  if ((s->presence & FW_PKT_FIRST_FRAG) && fragOverride != 0) return;
-  // UDP needs its 8-byte header in the frame; TCP its minimal 20-byte
-  // header, of which only the ports are read.
-  const uint32_t headerLen = proto == kProtoUdp ? 8 : 20;
-  if (l4 + headerLen > frameLen) return;
-  const uint8_t* ports;
-  if (l4 + headerLen <= mappedLen) {
-    ports = frame + l4;
-  } else {
-    const uint32_t fetch = proto == kProtoUdp ? 8 : 4;
-    ports = SLCGenericFindSGEntry(pkt, static_cast<uint32_t>(l4),
-                                  static_cast<uint32_t>(l4 + fetch));
-    if (ports == nullptr) return;
+  // fragment override decides fragments without looking at ports. UDP
+  // needs its 8-byte header in the frame; TCP its minimal 20-byte header,
+  // of which only the ports are read.
+  const bool udp = proto == kProtoUdp;
+  if ((proto == kProtoTcp || udp) && !(presence & FW_PKT_LATER_FRAG) &&
+      !((presence & FW_PKT_FIRST_FRAG) && fragOverride != 0)) {
+    const uint32_t headerLen = udp ? 8 : 20;
+    if (l4 + headerLen <= frameLen) {
+      const uint8_t* ports;
+      if (__builtin_expect(l4 + headerLen <= mappedLen, 1)) {
+        ports = frame + l4;
+      } else {
+        ports = SLCGenericFindSGEntry(pkt, static_cast<uint32_t>(l4),
+                                      static_cast<uint32_t>(l4 + (udp ? 8 : 4)));
+      }
+      if (ports != nullptr) {
+        __builtin_memcpy(SummaryBytes(s, offsetof(FWPktSummary, sPort)), ports, 4);
+        presence |= FW_PKT_PORTS | (udp ? FW_PKT_UDP : FW_PKT_TCP);
+      }
+    }
   }
-  s->sPort[0] = ports[0];
-  s->sPort[1] = ports[1];
-  s->dPort[0] = ports[2];
-  s->dPort[1] = ports[3];
-  s->presence |= FW_PKT_PORTS | (proto == kProtoUdp ? FW_PKT_UDP : FW_PKT_TCP);
+  s->presence = presence;
 }
 
 // The packet's match tuple, in the layout FWCreateTupleFromRule gives a
 // rule, and its hash. Only for packets with ports (so with L2 and L3).
-__attribute__((always_inline)) inline uint64_t FWTupleFromSummary(const FWPktSummary* s, FWRuleTuple* tuple) {
+__attribute__((always_inline)) inline uint64_t FWTupleFromSummary(
+    const FWPktSummary* __restrict s, FWRuleTuple* __restrict tuple) {
   uint8_t* t = tuple->bytes;
-  __builtin_memcpy(t + FW_TUPLE_DMAC, s->dMac, 6);
-  __builtin_memcpy(t + FW_TUPLE_SMAC, s->sMac, 6);
-  __builtin_memcpy(t + FW_TUPLE_ETHTYPE, s->ethType, 2);
-  __builtin_memcpy(t + FW_TUPLE_VLAN, s->vlan1QTag, 4);
+  const uint8_t* macs = s->dMac;  // sMac follows in the frame
+  const uint8_t* sa = s->ipSa;    // ipDa follows in the frame
+  __builtin_memcpy(t + FW_TUPLE_DMAC, macs, 12);
+  __builtin_memcpy(t + FW_TUPLE_ETHTYPE, SummaryBytes(s, offsetof(FWPktSummary, ethType)), 6);
   if (s->presence & FW_PKT_IPV4) {
-    __builtin_memcpy(t + FW_TUPLE_IPSA, s->ipSa, 4);
-    __builtin_memcpy(t + FW_TUPLE_V4_IPDA, s->ipDa, 4);
-    t[FW_TUPLE_V4_PROTO] = s->ipProto;
-    __builtin_memcpy(t + FW_TUPLE_V4_SPORT, s->sPort, 2);
-    __builtin_memcpy(t + FW_TUPLE_V4_DPORT, s->dPort, 2);
+    __builtin_memcpy(t + FW_TUPLE_IPSA, sa, 8);
+    __builtin_memcpy(t + FW_TUPLE_V4_PROTO, SummaryBytes(s, offsetof(FWPktSummary, ipProto)), 5);
     tuple->isIPv4 = 1;
     return HashFunc_HashBytes(t, FW_TUPLE_V4_HASHED);
   }
-  __builtin_memcpy(t + FW_TUPLE_IPSA, s->ipSa, 16);
-  __builtin_memcpy(t + FW_TUPLE_V6_IPDA, s->ipDa, 16);
-  t[FW_TUPLE_V6_PROTO] = s->ipProto;
-  __builtin_memcpy(t + FW_TUPLE_V6_SPORT, s->sPort, 2);
-  __builtin_memcpy(t + FW_TUPLE_V6_DPORT, s->dPort, 2);
+  __builtin_memcpy(t + FW_TUPLE_IPSA, sa, 32);
+  __builtin_memcpy(t + FW_TUPLE_V6_PROTO, SummaryBytes(s, offsetof(FWPktSummary, ipProto)), 5);
   tuple->isIPv4 = 0;
   return HashFunc_HashBytes(t, FW_TUPLE_V6_HASHED);
 }
@@ -293,55 +319,171 @@ inline uint32_t FWOverrideAction(uint32_t fragOverride) {
   }
 }
 
-// The walk proper; configLock held shared, ruleHash not null.
-void FWWalkList(FWWalk* walk, ZelPktList* list) {
+// Two shapes of the walk share the parse and the verdict below.
+//
+// Direct: each packet is parsed and decided in turn. Used while the exact
+// table is small enough to stay in the caches, where the fewest
+// instructions win.
+//
+// Pipelined: for large tables, whose bucket and entry loads miss the caches,
+// the misses of several packets are overlapped instead of added up. A
+// second, read-only iterator runs ahead of the one that carries out
+// verdicts:
+//   - kParseAhead packets ahead, a packet is parsed into a ring slot, its
+//     tuple hashed and its bucket head prefetched;
+//   - kEntryAhead packets ahead, the bucket's oldest entry (where the probe
+//     starts) is prefetched;
+//   - then the verdict runs on the parsed slot, with the main iterator on
+//     that packet.
+// Only the current packet is ever removed or replaced, and nothing is
+// inserted, so the iterator ahead and the parsed slots stay valid and the
+// main iterator reaches each slot's packet in order. Parsing a packet early
+// changes nothing: packets ahead are not touched by the current verdict.
+constexpr uint32_t kRingSize = 8;  // power of two, > kParseAhead
+constexpr uint32_t kParseAhead = 6;
+constexpr uint32_t kEntryAhead = 3;
+static_assert((kRingSize & (kRingSize - 1)) == 0 && kParseAhead < kRingSize &&
+              kEntryAhead < kParseAhead);
+// Tables with more buckets than this (more than 16384 exact rules) take the
+// pipelined walk: their 1 MiB of bucket heads and several MiB of entries no
+// longer sit in the per-core caches.
+constexpr uint32_t kPipelineMinBuckets = 65536;
+
+struct FWParsedPkt {
+  ZelPkt* pkt;
+  const ListLinks* bucket;  // the tuple's bucket; null without ports
+  uint64_t hash;            // with ports
+  uint32_t frameLen;
+  FWPktSummary summary;
+  FWRuleTuple tuple;        // with ports
+};
+
+// The exact-rule table as the walk reads it; fixed for the walk.
+struct FWTableView {
+  const ListLinks* buckets;
+  uint32_t mask;
+};
+
+// Parses `pkt` into `slot`, with its tuple, hash and bucket when it has
+// ports; prefetches the bucket head when asked.
+template <bool kPrefetch>
+__attribute__((always_inline)) inline void FWParseInto(ZelPkt* pkt, FWParsedPkt* slot,
+                                                       uint32_t fragOverride, FWTableView table) {
+  const uint32_t frameLen = zel_PktFrameLenGet(pkt);
+  uint32_t mappedLen = zel_PktFrameMappedLenGet(pkt);
+  if (mappedLen > frameLen) mappedLen = frameLen;
+  FWParseFrame(pkt, zel_PktFrameMappedPointerGet(pkt), frameLen, mappedLen, fragOverride,
+               &slot->summary);
+  slot->pkt = pkt;
+  slot->frameLen = frameLen;
+  if (slot->summary.presence & FW_PKT_PORTS) {
+    const uint64_t hash = FWTupleFromSummary(&slot->summary, &slot->tuple);
+    slot->hash = hash;
+    if constexpr (kPrefetch) {
+      const ListLinks* bucket = table.buckets + (static_cast<uint32_t>(hash) & table.mask);
+      __builtin_prefetch(bucket);
+      slot->bucket = bucket;
+    }
+  } else if constexpr (kPrefetch) {
+    slot->bucket = nullptr;
+  }
+}
+
+// The first rule entry the exact probe will compare (its bucket's oldest),
+// three cache lines of it: links and hash, match fields and counters,
+// direction.
+__attribute__((always_inline)) inline void FWPrefetchEntry(const FWParsedPkt* slot) {
+  const ListLinks* bucket = slot->bucket;
+  if (bucket == nullptr) return;
+  const ListLinks* oldest = bucket->prev;
+  if (oldest == bucket) return;
+  const char* e = reinterpret_cast<const char*>(oldest);
+  __builtin_prefetch(e);
+  __builtin_prefetch(e + 64);
+  __builtin_prefetch(e + 128);
+}
+
+// Decides the packet of `cur`, which the main iterator stands on, and
+// leaves the iterator on the next packet.
+__attribute__((always_inline)) inline void FWDecide(FWWalk* walk, FWParsedPkt* cur,
+                                                    bool haveGeneralRules) {
   FWFilterContext* ctx = walk->ctx;
+  ZelPkt* pkt = cur->pkt;
+  const FWPktSummary* summary = &cur->summary;
   const uint32_t direction = walk->direction;
-  const uint32_t fwFeatures = ctx->fwFeatures;
+
+  if (__builtin_expect(ctx->fwFeatures != 0, 0) &&
+      FWProcessFeatures(ctx, pkt, summary, direction) == SLCGenericActionDrop) {
+    FWDropCurrent(walk);
+    return;
+  }
+  if (__builtin_expect((summary->presence & (FW_PKT_FIRST_FRAG | FW_PKT_LATER_FRAG)) != 0, 0) &&
+      ctx->fragOverride != 0) {
+    FWApplyAction(walk, pkt, FWOverrideAction(ctx->fragOverride), nullptr, summary);
+    return;
+  }
+
+  FWRuleEntry* entry = nullptr;
+  if (summary->presence & FW_PKT_PORTS) {
+    entry = FWFindExactRule(ctx, &cur->tuple, cur->hash, direction, pkt);
+  }
+  if (entry == nullptr && haveGeneralRules) {
+    entry = FWFindRuleForPacket(walk->filter, pkt, direction, summary);
+  }
+  if (entry == nullptr) {
+    zel_PktListIterMove(walk->iter);
+    return;
+  }
+  // Plain adds under the shared hold: concurrent walks on one rule may lose
+  // an increment.
+  entry->rule.pktCount += 1;
+  entry->rule.byteCount += cur->frameLen;
+  const uint32_t action = entry->rule.action;
+  if (action == SLCGenericActionAccept) {  // the common verdict, without the dispatch
+    zel_PktListIterMove(walk->iter);
+    return;
+  }
+  FWApplyAction(walk, pkt, action, entry, summary);
+}
+
+// The walk proper; configLock held shared, ruleHash not null. `ahead` is
+// storage for the pipelined walk's second iterator.
+void FWWalkList(FWWalk* walk, ZelPktList* list, ZelPktListIter* ahead) {
+  FWFilterContext* ctx = walk->ctx;
+  const FWTableView table = {ctx->ruleHash->buckets, ctx->ruleHash->numBuckets - 1};
   const uint32_t fragOverride = ctx->fragOverride;
   const bool haveGeneralRules = !List_IsEmpty(&ctx->ruleList);
   ZelPktListIter* iter = walk->iter;
+  zel_PktListIterStart(list, iter);
 
-  FWPktSummary summary;
-  FWRuleTuple tuple;
-  for (zel_PktListIterStart(list, iter); !zel_PktListIterIsAtEnd(iter);) {
-    ZelPkt* pkt = zel_PktListIterGetPkt(iter);
-    const uint32_t frameLen = zel_PktFrameLenGet(pkt);
-    uint32_t mappedLen = zel_PktFrameMappedLenGet(pkt);
-    if (mappedLen > frameLen) mappedLen = frameLen;
-    const uint8_t* frame = zel_PktFrameMappedPointerGet(pkt);
+  if (ctx->ruleHash->numBuckets <= kPipelineMinBuckets) {
+    FWParsedPkt cur;
+    while (!zel_PktListIterIsAtEnd(iter)) {
+      FWParseInto<false>(zel_PktListIterGetPkt(iter), &cur, fragOverride, table);
+      FWDecide(walk, &cur, haveGeneralRules);
+    }
+    return;
+  }
 
-    summary.presence = FW_PKT_RPTAG;
-    __builtin_memset(summary.vlan1QTag, 0, sizeof(summary.vlan1QTag));
-    FWParseFrame(pkt, frame, frameLen, mappedLen, fragOverride, &summary);
-
-    if (fwFeatures != 0 &&
-        FWProcessFeatures(ctx, pkt, &summary, direction) == SLCGenericActionDrop) {
-      FWDropCurrent(walk);
-      continue;
+  FWParsedPkt ring[kRingSize];
+  uint32_t parsed = 0;  // packets parsed so far
+  uint32_t done = 0;    // packets given their verdict
+  zel_PktListIterStart(list, ahead);
+  while (parsed < kParseAhead && !zel_PktListIterIsAtEnd(ahead)) {
+    FWParseInto<true>(zel_PktListIterGetPkt(ahead), &ring[parsed++ & (kRingSize - 1)],
+                      fragOverride, table);
+    zel_PktListIterMove(ahead);
+  }
+  while (done != parsed) {
+    if (!zel_PktListIterIsAtEnd(ahead)) {
+      FWParseInto<true>(zel_PktListIterGetPkt(ahead), &ring[parsed++ & (kRingSize - 1)],
+                        fragOverride, table);
+      zel_PktListIterMove(ahead);
     }
-    if ((summary.presence & (FW_PKT_FIRST_FRAG | FW_PKT_LATER_FRAG)) && fragOverride != 0) {
-      FWApplyAction(walk, pkt, FWOverrideAction(fragOverride), nullptr, &summary);
-      continue;
+    if (parsed - done > kEntryAhead) {
+      FWPrefetchEntry(&ring[(done + kEntryAhead) & (kRingSize - 1)]);
     }
-
-    FWRuleEntry* entry = nullptr;
-    if (summary.presence & FW_PKT_PORTS) {
-      const uint64_t hash = FWTupleFromSummary(&summary, &tuple);
-      entry = FWFindExactRule(ctx, &tuple, hash, direction, pkt);
-    }
-    if (entry == nullptr && haveGeneralRules) {
-      entry = FWFindRuleForPacket(walk->filter, pkt, direction, &summary);
-    }
-    if (entry == nullptr) {
-      zel_PktListIterMove(iter);
-      continue;
-    }
-    // Plain adds under the shared hold: concurrent walks on one rule may
-    // lose an increment.
-    entry->rule.pktCount += 1;
-    entry->rule.byteCount += frameLen;
-    FWApplyAction(walk, pkt, entry->rule.action, entry, &summary);
+    FWDecide(walk, &ring[done++ & (kRingSize - 1)], haveGeneralRules);
   }
 }
 
@@ -355,7 +497,9 @@ ZelStatus FWProcessPackets(SLCGenericFilter* filter, ZelPktList* list, uint32_t 
     return FWProcessDefaultAction(ctx, list, direction);
   }
 
-  auto* iter = FW_STACK_OBJECT(ZelPktListIter, zel_PktListIterSizeOf());
+  const size_t iterSize = zel_PktListIterSizeOf();
+  auto* iter = FW_STACK_OBJECT(ZelPktListIter, iterSize);
+  auto* ahead = FW_STACK_OBJECT(ZelPktListIter, iterSize);
   const size_t listSize = zel_PktListSizeInBytes();
   auto* slowPathList = FW_STACK_OBJECT(ZelPktList, listSize);
   auto* reissueList = FW_STACK_OBJECT(ZelPktList, listSize);
@@ -371,7 +515,7 @@ ZelStatus FWProcessPackets(SLCGenericFilter* filter, ZelPktList* list, uint32_t 
   walk.direction = direction;
   walk.spAttachState = ctx->spAttachState;
   walk.failurePolicy = filter->failurePolicy;
-  FWWalkList(&walk, list);
+  FWWalkList(&walk, list, ahead);
   hold.Unlock();
 
   if (walk.slowPathUsed) {
@@ -387,8 +531,6 @@ void FWParsePacket(ZelPkt* pkt, uint32_t fragOverride, FWPktSummary* summary) {
   const uint32_t frameLen = zel_PktFrameLenGet(pkt);
   uint32_t mappedLen = zel_PktFrameMappedLenGet(pkt);
   if (mappedLen > frameLen) mappedLen = frameLen;
-  summary->presence = FW_PKT_RPTAG;
-  __builtin_memset(summary->vlan1QTag, 0, sizeof(summary->vlan1QTag));
   FWParseFrame(pkt, zel_PktFrameMappedPointerGet(pkt), frameLen, mappedLen, fragOverride, summary);
 }
 

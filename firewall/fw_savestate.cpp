@@ -31,8 +31,8 @@ void FWSaveState(SLCGenericFilter* filter, void* dst, uint32_t room) {
   if (ctx == nullptr || dst == nullptr) return;
 
   SLCGenericReadGuard config(ctx->configLock);
-  uint64_t ruleSize = FW_RULE_SIZE_V8;
-  if (FWGetRuleSize(ctx->version, &ruleSize) != ZEL_OK) ruleSize = FW_RULE_SIZE_V8;
+  uint64_t ruleSize = FW_RULE_SIZE_V8;  // kept if the version were ever not 7 or 8
+  (void)FWGetRuleSize(ctx->version, &ruleSize);
   const uint64_t need = FW_RULESET_HEADER_SIZE + ruleSize * ctx->numRules;
   if (need <= room) {
     FWPopulateRuleset(ctx, static_cast<FWRuleset*>(dst));

@@ -35,7 +35,7 @@ struct PacketSpec {
 
 class Packets {
  public:
-  static ZelPkt* Make(const PacketSpec& spec);
+  static ZelPkt* Make(const PacketSpec& layout);
   static ZelPkt* Make(std::span<const uint8_t> frame);
   // The whole frame, gathered from its elements.
   static std::vector<uint8_t> Frame(ZelPkt* pkt);

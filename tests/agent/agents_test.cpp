@@ -1,6 +1,8 @@
 // Agents: the create-agent property's splitting, creation in order, repeats,
 // and creation failing at each of its steps.
 
+#include <thread>
+
 #include "control/control.h"
 #include "module/module.h"
 #include "tests/support/module_fixture.h"
@@ -138,6 +140,33 @@ TEST_F(ModuleTest, EmptyNameCreatesNothingSilently) {
   EXPECT_EQ(SLCGenericInitFastPathAgent(nullptr), ZEL_OK);
   EXPECT_EQ(AgentNames().size(), 1u);
   EXPECT_TRUE(host::Log::Records().empty());
+}
+
+TEST_F(ModuleTest, ConcurrentCreatorsLoseNoAgent) {
+  // The property handler and the status tree may both append to agentList.
+  auto creator = [this](char prefix) {
+    for (int i = 0; i < 20; i++) {
+      std::string name = std::string(1, prefix) + std::to_string(i);
+      if (prefix == 'p') {
+        EXPECT_EQ(CreateAgents(name), ZEL_OK);
+      } else {
+        EXPECT_EQ(SLCGenericInitFastPathAgent(name.data()), ZEL_OK);
+      }
+    }
+  };
+  std::thread a(creator, 'p'), b(creator, 'q');
+  a.join();
+  b.join();
+  std::vector<std::string> names = AgentNames();
+  EXPECT_EQ(names.size(), 41u);
+  for (int i = 0; i < 20; i++) {
+    EXPECT_TRUE(host::Sluice::AgentRegistered("p" + std::to_string(i)));
+    EXPECT_NE(std::find(names.begin(), names.end(), "q" + std::to_string(i)), names.end());
+  }
+  // The list is consistent backwards too.
+  size_t back = 0;
+  for (ListLinks* l = agentList.prev; l != &agentList; l = l->prev) back++;
+  EXPECT_EQ(back, 41u);
 }
 
 TEST_F(ModuleTest, AgentsGoAwayOldestFirst) {

@@ -95,46 +95,40 @@ TEST_F(PropertyTest, ExactLengthsAreAcceptedAndApplied) {
   EXPECT_EQ(ctx_->ioctl, 0u);
 }
 
-TEST_F(PropertyTest, LengthMustMatchExactly) {
-  Bytes v7 = Ruleset({kGeneral22, kGeneral23}, 7);
-  Bytes shorter(v7.begin(), v7.end() - 1);
-  Bytes longer = v7;
-  longer.push_back(0);
-  EXPECT_EQ(Write(shorter), ZEL_BAD_PARAM);
-  EXPECT_TRUE(host::Log::Contains(
-      "Invalid ruleset length for version 7(ruleSize = 259). Got 532, expecting 533", 2));
-  EXPECT_EQ(Write(longer), ZEL_BAD_PARAM);
-  EXPECT_TRUE(host::Log::Contains(
-      "Invalid ruleset length for version 7(ruleSize = 259). Got 534, expecting 533", 2));
-  // A count whose size overflows 32 bits is compared in 64.
-  Bytes huge = Ruleset(std::vector<std::string>{});
-  controltest::PutU32(&huge, 3, 0xffffffffu);
-  EXPECT_EQ(Write(huge), ZEL_BAD_PARAM);
-  EXPECT_TRUE(host::Log::Contains(
-      "Invalid ruleset length for version 8(ruleSize = 281). Got 15, expecting 1206885809910", 2));
-  EXPECT_EQ(ctx_->ruleHash, nullptr);
-}
-
-TEST_F(PropertyTest, VersionIsCheckedBeforeLength) {
+// Checks in order: data, version (whatever the length), header present,
+// exact length (compared in 64 bits).
+TEST_F(PropertyTest, WriteChecksVersionThenLength) {
+  EXPECT_EQ(Ops()->write(Filter(id_), nullptr, nullptr, 15), ZEL_BAD_PARAM);
+  EXPECT_EQ(host::Log::Count("Invalid ruleset", 2), 1u);
   for (size_t len : {1u, 3u, 15u, 40u}) {
     Bytes data(len, 0);
     data[0] = 9;
     EXPECT_EQ(Write(data), ZEL_NOT_SUPPORTED) << len;
   }
   EXPECT_EQ(host::Log::Count("Invalid ruleset version. Got 9, expecting 8", 2), 4u);
-}
-
-// Shorter than the header: refused as an invalid ruleset without its count
-// being read (the host hands the handler an exactly sized copy).
-TEST_F(PropertyTest, WritesShorterThanTheHeaderAreRefused) {
+  // Shorter than the header: refused without the count being read (the
+  // host hands the handler an exactly sized copy).
   for (size_t len = 0; len < 15; ++len) {
     Bytes data(len, 0);
     if (len > 0) data[0] = 8;
     EXPECT_EQ(Write(data), ZEL_BAD_PARAM) << len;
   }
-  EXPECT_EQ(host::Log::Count("Invalid ruleset", 2), 15u);
-  EXPECT_EQ(Ops()->write(Filter(id_), nullptr, nullptr, 15), ZEL_BAD_PARAM);
   EXPECT_EQ(host::Log::Count("Invalid ruleset", 2), 16u);
+
+  Bytes v7 = Ruleset({kGeneral22, kGeneral23}, 7);
+  EXPECT_EQ(Write(Bytes(v7.begin(), v7.end() - 1)), ZEL_BAD_PARAM);
+  EXPECT_TRUE(host::Log::Contains(
+      "Invalid ruleset length for version 7(ruleSize = 259). Got 532, expecting 533", 2));
+  v7.push_back(0);
+  EXPECT_EQ(Write(v7), ZEL_BAD_PARAM);
+  EXPECT_TRUE(host::Log::Contains(
+      "Invalid ruleset length for version 7(ruleSize = 259). Got 534, expecting 533", 2));
+  Bytes huge = Ruleset(std::vector<std::string>{});
+  controltest::PutU32(&huge, 3, 0xffffffffu);
+  EXPECT_EQ(Write(huge), ZEL_BAD_PARAM);
+  EXPECT_TRUE(host::Log::Contains(
+      "Invalid ruleset length for version 8(ruleSize = 281). Got 15, expecting 1206885809910", 2));
+  EXPECT_EQ(ctx_->ruleHash, nullptr);
 }
 
 // The ruleset checks come first; only a well-formed write reaches the

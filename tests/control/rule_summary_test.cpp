@@ -142,31 +142,12 @@ TEST_F(RuleSummaryTest, WildcardAndRangeListsDropTheLastComma) {
 }
 
 TEST_F(RuleSummaryTest, NegationsRangesAndMasks) {
-  FWRule r = Blank();
-  r.action = SLCGenericActionDrop;
-  r.direction = 3;
-  r.bidirectional = 1;
-  r.ruleFlags = FW_FLAG_IPV4 | FW_RANGE_IPSA | FW_RANGE_DPORT | FW_WC_RPTAG;
-  r.negateFlags = FW_NEG_IPSA | FW_NEG_DPORT | FW_NEG_ETHTYPE | FW_NEG_SMAC | FW_NEG_VLAN |
-                  FW_NEG_IPPROTO;
-  const uint8_t mac[6] = {0x00, 0x11, 0x22, 0x33, 0x44, 0x55};
-  const uint8_t mask[6] = {0xff, 0xff, 0xff, 0x00, 0x00, 0x00};
-  std::memcpy(r.dMac, mac, 6);
-  std::memcpy(r.dMacMask, mask, 6);
-  std::memcpy(r.sMac, mac, 6);
-  std::memcpy(r.sMacMask, mac, 6);
-  FWPutNet16(r.ethType, 0x0800);
-  Set4(r.vlan1QTag, 0x81, 0x00, 0x00, 0x0a);
-  Set4(r.ipSa, 10, 0, 0, 1);
-  Set4(r.ipSaHigh, 10, 0, 0, 9);
-  r.ipProto = 17;
-  FWPutNet16(r.sPort, 80);
-  FWPutNet16(r.dPort, 1000);
-  FWPutNet16(r.dPortHigh, 2000);
-  r.pktCount = 18446744073709551615ull;
-  r.byteCount = 1234567890123ull;
-
-  SLCGeneric_RuleSummary s = Of(r);
+  const std::string fields =
+      "action=drop dir=both bidir ipv4 dmac=00:11:22:33:44:55/ff:ff:ff:00:00:00 "
+      "smac=!00:11:22:33:44:55/00:11:22:33:44:55 ethtype=!0x0800 vlan=!raw:8100000a "
+      "sa=!10.0.0.1-10.0.0.9 da=0.0.0.0 proto=!17 sport=80 dport=!1000-2000 "
+      "pkts=18446744073709551615 bytes=1234567890123";
+  SLCGeneric_RuleSummary s = Of(rules::ParseRule(fields));
   EXPECT_STREQ(s.dMac, " (00:11:22:33:44:55/ff:ff:ff:00:00:00)");
   EXPECT_STREQ(s.sMac, " ! (00:11:22:33:44:55)");
   EXPECT_STREQ(s.ethType, " !(0x0800)");
@@ -181,8 +162,9 @@ TEST_F(RuleSummaryTest, NegationsRangesAndMasks) {
   EXPECT_STREQ(s.pktCount, "18446744073709551615");
   EXPECT_STREQ(s.byteCount, "1234567890123");
 
-  r.negateFlags = 0;
-  s = Of(r);
+  FWRule plain = rules::ParseRule(fields);
+  plain.negateFlags = 0;
+  s = Of(plain);
   EXPECT_STREQ(s.ipSa, "(IPv4): (10.0.0.1 - 10.0.0.9)");
   EXPECT_STREQ(s.vlan1QTag, "167772289");
   EXPECT_STREQ(s.sMac, " (00:11:22:33:44:55)");

@@ -85,17 +85,17 @@ TEST_F(ApplyTest, AddKeepsFormerRulesTheirCountersAndScanOrder) {
   EXPECT_EQ(ctx_->numRules, 4u);
   auto general = GeneralEntries();
   ASSERT_EQ(general.size(), 2u);
-  EXPECT_EQ(general[0]->rule.byteCount, 99u);  // earlier ruleset scanned first
-  EXPECT_EQ(general[1]->rule.action, SLCGenericActionPunt);
+  EXPECT_EQ(+general[0]->rule.byteCount, 99u);  // earlier ruleset scanned first
+  EXPECT_EQ(+general[1]->rule.action, SLCGenericActionPunt);
   FWRuleEntry* kept = FindExact(rules::ParseRule(Exact("10.0.0.1", 1, "10.0.0.2", 80)));
   ASSERT_NE(kept, nullptr);
-  EXPECT_EQ(kept->rule.pktCount, 42u);
-  EXPECT_EQ(FindExact(rules::ParseRule(Exact("10.0.0.5", 1, "10.0.0.6", 80)))->rule.pktCount, 3u);
+  EXPECT_EQ(+kept->rule.pktCount, 42u);
+  EXPECT_EQ(+FindExact(rules::ParseRule(Exact("10.0.0.5", 1, "10.0.0.6", 80)))->rule.pktCount, 3u);
 
   // Replacing starts every rule from its record again.
   ASSERT_EQ(Apply(Rs(Exact("10.0.0.1", 1, "10.0.0.2", 80))), ZEL_OK);
   EXPECT_EQ(ctx_->numRules, 1u);
-  EXPECT_EQ(ExactEntries()[0]->rule.pktCount, 0u);
+  EXPECT_EQ(+ExactEntries()[0]->rule.pktCount, 0u);
   EXPECT_TRUE(GeneralEntries().empty());
 }
 
@@ -106,8 +106,8 @@ TEST_F(ApplyTest, RepeatedExactRulesMergeIntoTheFirst) {
   EXPECT_EQ(host::Log::Count("Firewall rule already present, ignoring", 2), 1u);
   EXPECT_EQ(ctx_->numRules, 1u);
   FWRuleEntry* e = ExactEntries()[0];
-  EXPECT_EQ(e->rule.action, SLCGenericActionDrop);
-  EXPECT_EQ(e->rule.pktCount, 0u);
+  EXPECT_EQ(+e->rule.action, SLCGenericActionDrop);
+  EXPECT_EQ(+e->rule.pktCount, 0u);
 
   // Other direction widens to both, silently; a mirrored-half record with the
   // same direction only sets bidirectional 2.
@@ -121,7 +121,7 @@ TEST_F(ApplyTest, RepeatedExactRulesMergeIntoTheFirst) {
   e = ExactEntries()[0];  // adding copies the table
   EXPECT_EQ(e->rule.direction, SLCGenericDirectionBidirectional);
   EXPECT_EQ(e->rule.bidirectional, 2);
-  EXPECT_EQ(e->rule.action, SLCGenericActionDrop);
+  EXPECT_EQ(+e->rule.action, SLCGenericActionDrop);
 }
 
 TEST_F(ApplyTest, BidirectionalExactRuleInstallsItsMirror) {
@@ -151,7 +151,7 @@ TEST_F(ApplyTest, BidirectionalExactRuleInstallsItsMirror) {
   FWRuleEntry* merged = FindExact(rules::ParseRule(reply));
   EXPECT_EQ(merged->rule.direction, SLCGenericDirectionBidirectional);
   EXPECT_EQ(merged->rule.bidirectional, 2);
-  EXPECT_EQ(merged->rule.action, SLCGenericActionAccept);
+  EXPECT_EQ(+merged->rule.action, SLCGenericActionAccept);
 
   // bidirectional means nothing on a general rule.
   ASSERT_EQ(Apply(Rs("action=drop bidir sa=10.0.0.1 da=10.0.0.2 sport=1 dport=2\n")), ZEL_OK);

@@ -60,90 +60,46 @@ Bytes EchoMsg(const std::string& text, bool nul = true) {
   return m;
 }
 
-// --- Echo ----------------------------------------------------------------------
-
-TEST_F(IoctlTest, EchoUpperCasesTextAndKeepsLength) {
+TEST_F(IoctlTest, EchoUpperCasesAtMost64CharactersWithinThePayload) {
   auto replies = Ioctl(id_, EchoMsg("ab1z"), 5);
   ASSERT_EQ(replies.size(), 1u);
   EXPECT_EQ(replies[0].requestCode, 5u);
-  EXPECT_EQ(replies[0].message, EchoMsg("AB1Z"));
-  EXPECT_EQ(replies[0].message.size(), 9u);
-}
+  EXPECT_EQ(replies[0].message, EchoMsg("AB1Z"));  // 9 bytes, NUL included
 
-TEST_F(IoctlTest, EchoWithRequestCodeZeroIsNotAnswered) {
   EXPECT_TRUE(Ioctl(id_, EchoMsg("ab1z"), 0).empty());
-}
 
-TEST_F(IoctlTest, EchoUpperCasesOnlyTheFirst64Characters) {
-  auto replies = Ioctl(id_, EchoMsg(std::string(70, 'q')), 1);
+  replies = Ioctl(id_, EchoMsg(std::string(70, 'q')), 1);
   ASSERT_EQ(replies.size(), 1u);
   EXPECT_EQ(replies[0].message, EchoMsg(std::string(64, 'Q') + std::string(6, 'q')));
-}
 
-TEST_F(IoctlTest, EchoWithoutNulStopsAtThePayloadEnd) {
-  auto replies = Ioctl(id_, EchoMsg("abc", false), 1);
+  // No NUL: the text ends with the payload (the host's copy is exactly sized).
+  replies = Ioctl(id_, EchoMsg("abc", false), 1);
   ASSERT_EQ(replies.size(), 1u);
   EXPECT_EQ(replies[0].message, EchoMsg("ABC", false));
-  // Only the type: nothing to upper-case, echoed as it came.
-  replies = Ioctl(id_, EchoMsg("", false), 1);
-  ASSERT_EQ(replies.size(), 1u);
-  EXPECT_EQ(replies[0].message.size(), 4u);
 }
 
-// --- Push ----------------------------------------------------------------------
-
-TEST_F(IoctlTest, PushOfExactLengthIsAppliedAndSetsTheIoctlFlag) {
+TEST_F(IoctlTest, PushMustHaveExactLength) {
   Bytes msg = Push(Ruleset({kExactA, kGeneral22}));
   ASSERT_EQ(msg.size(), 585u);
+  Bytes shorter(msg.begin(), msg.end() - 1);
+  EXPECT_EQ(IoctlStatus(id_, shorter), 0);
+  EXPECT_TRUE(host::Log::Contains(
+      "Invalid ruleset length for version 8(ruleSize = 281). Got 576, expecting 577", 2));
+  Bytes v9 = msg;
+  v9[8] = 9;
+  EXPECT_EQ(IoctlStatus(id_, v9), 0);
+  EXPECT_TRUE(host::Log::Contains("Failed to get rule size for version 9", 2));
+  // Shorter than its header: refused without reading past it.
+  for (size_t len : {4u, 11u, 22u}) {
+    EXPECT_EQ(IoctlStatus(id_, Bytes(msg.begin(), msg.begin() + len)), 0) << len;
+  }
+  EXPECT_EQ(ctx_->ruleHash, nullptr);
+  EXPECT_EQ(ctx_->ioctl, 0u);
+
   EXPECT_EQ(IoctlStatus(id_, msg), 1);
   EXPECT_TRUE(host::Log::Contains("Received Firewall ruleset via Sluice IOCTL, payloadSize: 585", 1));
   EXPECT_EQ(ctx_->numRules, 2u);
   EXPECT_EQ(ctx_->ioctl, 1u);
-}
-
-TEST_F(IoctlTest, PushOneByteShortIsRefusedWithTheLengthMessage) {
-  Bytes msg = Push(Ruleset({kExactA, kGeneral22}));
-  msg.pop_back();
-  EXPECT_EQ(IoctlStatus(id_, msg), 0);
-  EXPECT_TRUE(host::Log::Contains(
-      "Invalid ruleset length for version 8(ruleSize = 281). Got 576, expecting 577", 2));
-  EXPECT_EQ(ctx_->ruleHash, nullptr);
-  EXPECT_EQ(ctx_->ioctl, 0u);
-}
-
-TEST_F(IoctlTest, PushWithTrailingByteOrUnknownVersionIsRefused) {
-  Bytes msg = Push(Ruleset({kExactA}, 7));
-  msg.push_back(0);
-  EXPECT_EQ(IoctlStatus(id_, msg), 0);
-  EXPECT_TRUE(host::Log::Contains(
-      "Invalid ruleset length for version 7(ruleSize = 259). Got 275, expecting 274", 2));
-
-  Bytes v9 = Push(Ruleset({kExactA}));
-  v9[8] = 9;
-  EXPECT_EQ(IoctlStatus(id_, v9), 0);
-  EXPECT_TRUE(host::Log::Contains("Failed to get rule size for version 9", 2));
-  EXPECT_EQ(ctx_->ruleHash, nullptr);
-}
-
-TEST_F(IoctlTest, TruncatedPushIsRefusedWithoutReadingPastIt) {
-  Bytes full = Push(Ruleset(std::vector<std::string>{}));
-  ASSERT_EQ(full.size(), 23u);
-  for (size_t len : {4u, 8u, 11u, 22u}) {
-    EXPECT_EQ(IoctlStatus(id_, Bytes(full.begin(), full.begin() + len)), 0) << len;
-  }
-  EXPECT_EQ(host::Log::Count("Truncated firewall ioctl message of type 2, payloadSize: 22"), 1u);
-  EXPECT_EQ(ctx_->ioctl, 0u);
-  // The bare header is a complete, empty ruleset.
-  EXPECT_EQ(IoctlStatus(id_, full), 1);
-  EXPECT_NE(ctx_->ruleHash, nullptr);
-}
-
-TEST_F(IoctlTest, AddingPushKeepsTheRulesInForce) {
-  ASSERT_EQ(IoctlStatus(id_, Push(Ruleset({kExactA}))), 1);
-  ASSERT_EQ(IoctlStatus(id_, Push(Ruleset({kGeneral22}), 0)), 1);
-  EXPECT_EQ(ctx_->numRules, 2u);
-  ASSERT_EQ(IoctlStatus(id_, Push(Ruleset({kExactB}), 1)), 1);
-  EXPECT_EQ(ctx_->numRules, 1u);
 }
 
 // Once a ruleset came through the ioctl channel, the property and restores
@@ -153,7 +109,6 @@ TEST_F(IoctlTest, IoctlRulesetMakesPropertyWritesAndRestoresIgnored) {
   EXPECT_EQ(IoctlStatus(id_, Push(Ruleset({kExactA}))), 0);
   host::Faults::ClearAll();
   EXPECT_EQ(ctx_->ioctl, 1u);
-  EXPECT_EQ(ctx_->ruleHash, nullptr);
 
   Bytes other = Ruleset({kExactB, kGeneral22});
   std::string prop = std::string(testsupport::kDefaultAgent) + ".ruleset";
@@ -185,16 +140,13 @@ TEST_F(IoctlTest, StateReplyIsSizedForVersion8RulesAndCarriesCounters) {
   const size_t second = 15 + 281 + offsetof(FWRule, pktCount);
   EXPECT_EQ(GetU64(state, second), 5u);
   EXPECT_EQ(GetU64(state, second + 8), 700u);
-}
 
-TEST_F(IoctlTest, StateReplyOfVersion7RulesetLeavesTheTailZero) {
+  // Version 7: records 259 bytes apart, bit 9 written clear, zero tail.
   ASSERT_EQ(IoctlStatus(id_, Push(Ruleset({kGeneral22, kGeneral23}, 7))), 1);
-  Bytes state = State();
+  state = State();
   ASSERT_EQ(state.size(), 15u + 2 * 281);
   EXPECT_EQ(state[0], 7);
-  // Records are 259 bytes apart; bit 9 is written clear as it was sent.
-  uint32_t flags2 = GetU32(state, 15 + 259 + offsetof(FWRule, ruleFlags));
-  EXPECT_EQ(flags2 & FW_WC_RPTAG, 0u);
+  EXPECT_EQ(GetU32(state, 15 + 259 + offsetof(FWRule, ruleFlags)) & FW_WC_RPTAG, 0u);
   EXPECT_EQ(state[15 + 259 + offsetof(FWRule, dPort) + 1], 23);
   for (size_t i = 15 + 2 * 259; i < state.size(); ++i) ASSERT_EQ(state[i], 0) << i;
 }
@@ -260,41 +212,31 @@ TEST_F(IoctlTest, ResetCountersOfGeneralRuleKeepsItsEntry) {
   EXPECT_TRUE(host::Log::Contains("Asked to remove stats for non-existent rule, ignoring.", 2));
 }
 
-TEST_F(IoctlTest, RemoveGeneralRuleIgnoresActionDirectionAndRanges) {
-  ASSERT_EQ(IoctlStatus(id_, Push(Ruleset({kGeneral22, kGeneral23}))), 1);
-  // Same wildcards and compared fields, different action and direction.
-  EXPECT_EQ(IoctlStatus(id_, Clear(FWClearMethodRemove,
-                                   Ruleset({"action=accept dir=from ipv4 proto=tcp dport=23"}))),
-            1);
-  Bytes state = State();
-  ASSERT_EQ(GetU32(state, 3), 1u);
-  EXPECT_EQ(state[15 + offsetof(FWRule, dPort) + 1], 22);
-}
-
-// A rule with a range but no wildcard lives in the general list; the clear
-// finds it there although a hash probe cannot.
-TEST_F(IoctlTest, RemoveRangeRuleWithoutWildcards) {
+// General rules are named by wildcard bits and compared fields only (not
+// action or direction); a range rule without wildcards is found in the
+// general list although a hash probe cannot find it.
+TEST_F(IoctlTest, RemoveGeneralAndRangeRules) {
   const std::string range =
       "action=drop dir=to ipv4 proto=tcp sa=10.0.0.1 da=10.0.0.2 sport=1 dport=100-200" + kL2;
-  ASSERT_EQ(IoctlStatus(id_, Push(Ruleset({range, kExactA}))), 1);
-  EXPECT_EQ(IoctlStatus(id_, Clear(FWClearMethodRemove, Ruleset({range}))), 1);
+  ASSERT_EQ(IoctlStatus(id_, Push(Ruleset({kGeneral22, kGeneral23, range, kExactA}))), 1);
+  const std::string other23 = "action=accept dir=from ipv4 proto=tcp dport=23";
+  EXPECT_EQ(IoctlStatus(id_, Clear(FWClearMethodRemove, Ruleset({other23, range}))), 1);
   EXPECT_EQ(host::Log::Count("Asked to remove non-existent rule, ignoring."), 0u);
   Bytes state = State();
-  ASSERT_EQ(GetU32(state, 3), 1u);
+  ASSERT_EQ(GetU32(state, 3), 2u);
   EXPECT_EQ(state[15 + offsetof(FWRule, dPort) + 1], 80);
+  EXPECT_EQ(state[15 + 281 + offsetof(FWRule, dPort) + 1], 22);
 }
 
-TEST_F(IoctlTest, UnexpectedClearMethodChangesNothing) {
+TEST_F(IoctlTest, UnexpectedMethodOrNoRulesetChangesNothing) {
+  EXPECT_EQ(IoctlStatus(id_, Clear(FWClearMethodRemove, Ruleset({kExactA}))), 1);
+  EXPECT_TRUE(host::Log::Contains("Asked to clear firewall rules, when none are in effect.", 2));
+
   ASSERT_EQ(IoctlStatus(id_, Push(Ruleset({kExactA}))), 1);
   EXPECT_EQ(IoctlStatus(id_, Clear(7, Ruleset({kExactA, kExactB}))), 1);
   EXPECT_EQ(host::Log::Count("Unexpected clear method", 2), 1u);
   EXPECT_EQ(host::Log::Count("Asked to remove non-existent rule, ignoring.", 2), 1u);
   EXPECT_EQ(GetU32(State(), 3), 1u);
-}
-
-TEST_F(IoctlTest, ClearWithoutRulesetInForceIsReportedAndSucceeds) {
-  EXPECT_EQ(IoctlStatus(id_, Clear(FWClearMethodRemove, Ruleset({kExactA}))), 1);
-  EXPECT_TRUE(host::Log::Contains("Asked to clear firewall rules, when none are in effect.", 2));
 }
 
 // Hostile clears: nothing is read past the payload and nothing changes.

@@ -45,16 +45,16 @@ TEST(RuleSize, Bit9IsTouchedOnlyUpToVersion7) {
   for (uint32_t v : {0u, 5u, 7u}) {
     r.ruleFlags = 0x11;
     FWUpdateWildcardsToCurrent(v, &r);
-    EXPECT_EQ(r.ruleFlags, 0x211u);
+    EXPECT_EQ(+r.ruleFlags, 0x211u);
     FWRevertWildcardsToOriginal(v, &r);
-    EXPECT_EQ(r.ruleFlags, 0x11u);
+    EXPECT_EQ(+r.ruleFlags, 0x11u);
   }
   r.ruleFlags = 0x11;
   FWUpdateWildcardsToCurrent(8, &r);
-  EXPECT_EQ(r.ruleFlags, 0x11u);
+  EXPECT_EQ(+r.ruleFlags, 0x11u);
   r.ruleFlags = 0x211;
   FWRevertWildcardsToOriginal(8, &r);
-  EXPECT_EQ(r.ruleFlags, 0x211u);
+  EXPECT_EQ(+r.ruleFlags, 0x211u);
 }
 
 FWRule ExactV4() {
@@ -188,7 +188,7 @@ TEST(Export, RulesetGetNarrowsVersion7) {
   e.rule.rpTag = 0x1234;  // not part of a version-7 record
   EXPECT_TRUE(FWIterRulesetGet(&e, rs));
   EXPECT_TRUE(FWIterRulesetGet(&e, rs));
-  EXPECT_EQ(rs->numRules, 2u);
+  EXPECT_EQ(+rs->numRules, 2u);
   FWRule expect = e.rule;
   expect.ruleFlags &= ~FW_WC_RPTAG;
   EXPECT_EQ(std::memcmp(buf.data() + 15, &expect, 259), 0);

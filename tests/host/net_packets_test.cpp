@@ -23,30 +23,30 @@ class PacketTest : public testsupport::HostTest {
  protected:
   // 64 bytes in elements of 20, 30 and 14 bytes, 10 of them mapped.
   static host::PacketSpec ThreeElements() {
-    host::PacketSpec spec;
-    spec.frame = Bytes(64);
-    spec.sgSizes = {20, 30, 14};
-    spec.mappedLen = 10;
-    spec.vlanId = 0x123;
-    spec.priority = 5;
-    spec.resPoolTag = 7;
-    return spec;
+    host::PacketSpec layout;
+    layout.frame = Bytes(64);
+    layout.sgSizes = {20, 30, 14};
+    layout.mappedLen = 10;
+    layout.vlanId = 0x123;
+    layout.priority = 5;
+    layout.resPoolTag = 7;
+    return layout;
   }
 };
 
 TEST_F(PacketTest, GettersReportFrameAndMetadata) {
-  host::PacketSpec spec = ThreeElements();
-  ZelPkt* pkt = host::Packets::Make(spec);
+  host::PacketSpec layout = ThreeElements();
+  ZelPkt* pkt = host::Packets::Make(layout);
   EXPECT_EQ(zel_PktFrameLenGet(pkt), 64u);
   EXPECT_EQ(zel_PktFrameMappedLenGet(pkt), 10u);
-  EXPECT_EQ(0, std::memcmp(zel_PktFrameMappedPointerGet(pkt), spec.frame.data(), 10));
+  EXPECT_EQ(0, std::memcmp(zel_PktFrameMappedPointerGet(pkt), layout.frame.data(), 10));
   EXPECT_EQ(zel_PktVlanIDGet(pkt), 0x123);
   EXPECT_EQ(zel_PktPriorityGet(pkt), 5);
   uint16_t tag = 0;
   ASSERT_EQ(zel_PktResPoolTagGet(pkt, &tag), ZEL_OK);
   EXPECT_EQ(tag, 7);
   EXPECT_EQ(zel_PktSgArrayGet(pkt), 3);
-  EXPECT_EQ(host::Packets::Frame(pkt), spec.frame);
+  EXPECT_EQ(host::Packets::Frame(pkt), layout.frame);
 
   ASSERT_EQ(zel_PktPrioritySet(pkt, 3), ZEL_OK);
   EXPECT_EQ(zel_PktPrioritySet(pkt, 8), ZEL_BAD_PARAM);
@@ -57,18 +57,18 @@ TEST_F(PacketTest, GettersReportFrameAndMetadata) {
 }
 
 TEST_F(PacketTest, ElementsMapBackToTheirBytesWithinBounds) {
-  host::PacketSpec spec = ThreeElements();
-  ZelPkt* pkt = host::Packets::Make(spec);
+  host::PacketSpec layout = ThreeElements();
+  ZelPkt* pkt = host::Packets::Make(layout);
   uint32_t offset = 0;
   std::vector<uint64_t> addrs;
   for (uint16_t i = 0; i < 3; i++) {
     ZelSgElem elem{};
     ASSERT_EQ(zel_PktSgElemGet(pkt, i, &elem), ZEL_OK);
-    ASSERT_EQ(elem.length, spec.sgSizes[i]);
+    ASSERT_EQ(elem.length, layout.sgSizes[i]);
     void* va = nullptr;
     ASSERT_EQ(zel_MA2VA(elem.machineAddr, elem.length, &va), ZEL_OK);
     EXPECT_NE(elem.machineAddr, reinterpret_cast<uintptr_t>(va)) << "machine address is a pointer";
-    EXPECT_EQ(0, std::memcmp(va, spec.frame.data() + offset, elem.length));
+    EXPECT_EQ(0, std::memcmp(va, layout.frame.data() + offset, elem.length));
     // A range inside the element maps to the matching place.
     void* inner = nullptr;
     ASSERT_EQ(zel_MA2VA(elem.machineAddr + 5, elem.length - 5, &inner), ZEL_OK);
@@ -121,16 +121,16 @@ TEST_F(PacketTest, CloneIsAnIndependentCopyWithTheSameSerial) {
 }
 
 TEST_F(PacketTest, PartialCopyMapsTheRequestedBytesWritable) {
-  host::PacketSpec spec = ThreeElements();
-  spec.writable = false;
-  ZelPkt* pkt = host::Packets::Make(spec);
+  host::PacketSpec layout = ThreeElements();
+  layout.writable = false;
+  ZelPkt* pkt = host::Packets::Make(layout);
   for (uint32_t n : {1u, 14u, 30u, 64u}) {
     SCOPED_TRACE(n);
     ZelPkt* copy = nullptr;
     ASSERT_EQ(zel_PktPartialCopy(pkt, n, &copy), ZEL_OK);
     EXPECT_EQ(zel_PktFrameMappedLenGet(copy), n);
     EXPECT_TRUE(zel_PktIsBufDescWritable(copy));
-    EXPECT_EQ(host::Packets::Frame(copy), spec.frame);
+    EXPECT_EQ(host::Packets::Frame(copy), layout.frame);
     EXPECT_EQ(host::Packets::Serial(copy), host::Packets::Serial(pkt));
     EXPECT_EQ(zel_PktVlanIDGet(copy), 0x123);
     ZelSgElem e0{};

@@ -70,10 +70,7 @@ std::vector<frames::CaptureRecord> Capture() {
       {2, out("10.0.0.1", "192.168.1.1").Udp(7, 7).Payload(64).Build()},
       {2, out("10.0.0.1", "10.2.3.4").Udp(9, 9).Payload(16).Build()},
       {2, out("10.0.0.1", "10.0.0.9").Udp(67, 68).Payload(300).Build()},
-      {1, FrameBuilder()
-              .Eth(vm, gw)
-              .Arp(1, gw, Ip4("10.0.0.254"), vm, Ip4("10.0.0.1"))
-              .Build()},
+      {1, FrameBuilder().Eth(vm, gw).Arp(1, gw, Ip4("10.0.0.254"), vm, Ip4("10.0.0.1")).Build()},
       {2, FrameBuilder()
               .Eth(gw, vm)
               .Ipv6(frames::Ip6("2001:db8::1"), frames::Ip6("2001:db8::2"))
@@ -136,12 +133,12 @@ class MigrationEndToEndTest : public testsupport::ModuleTest {
  protected:
   struct Vm {
     std::string name;
-    std::vector<Bytes> rulesets;   // applied in order, the first replacing
+    std::vector<Bytes> rulesets;  // applied in order, the first replacing
     Bytes slowPathState;
     host::FilterId id = 0;
-    Bytes saved;                   // what crossed to the destination
+    Bytes saved;  // what crossed to the destination
     Bytes rulesAtSave;
-    std::vector<Verdict> verdicts; // on the source
+    std::vector<Verdict> verdicts;  // on the source
   };
 
   host::FilterId NewFilter(const std::string& name) {
@@ -164,8 +161,8 @@ class MigrationEndToEndTest : public testsupport::ModuleTest {
       Verdict v;
       EXPECT_EQ(Deliver(id, {rec.frame}, rec.direction, &v.passed), ZEL_OK);
       for (auto* list : {&v.faulted, &v.issued}) {
-        std::vector<host::Delivery> d = list == &v.faulted ? host::Sluice::TakeFaulted(id)
-                                                           : host::Sluice::TakeIssued(id);
+        std::vector<host::Delivery> d =
+            list == &v.faulted ? host::Sluice::TakeFaulted(id) : host::Sluice::TakeIssued(id);
         for (const host::Delivery& delivery : d) {
           for (ZelPkt* pkt : delivery.packets) list->push_back(host::Packets::Frame(pkt));
         }
@@ -266,7 +263,8 @@ TEST_F(MigrationEndToEndTest, DestinationContinuesWhereTheSourceStopped) {
 
     const Bytes restored = migsupport::Rules(f);
     EXPECT_TRUE(View(restored) == View(vm.rulesAtSave))
-        << rules::FormatRuleset(restored) << "\n---- source:\n" << rules::FormatRuleset(vm.rulesAtSave);
+        << rules::FormatRuleset(restored) << "\n---- source:\n"
+        << rules::FormatRuleset(vm.rulesAtSave);
 
     const std::vector<Verdict> verdicts = Run(vm.id, capture);
     ASSERT_EQ(verdicts.size(), capture.size());

@@ -29,8 +29,10 @@
 // configLock, accepting that concurrent walks of one filter may lose an
 // increment (and that a save may read a counter mid-update). Those are the
 // only races this test is allowed to see; the increment is the top frame of
-// every such report.
+// every such report. The longer history keeps that frame restorable, so the
+// suppression matches the counter update and nothing else.
 extern "C" const char* __tsan_default_suppressions() { return "race_top:FWWalkList\n"; }
+extern "C" const char* __tsan_default_options() { return "history_size=7"; }
 
 namespace {
 
@@ -61,11 +63,12 @@ std::vector<Bytes> StressFrames() {
   using frames::Ip4;
   const auto vm = frames::Mac(migsupport::kVmMac);
   const auto gw = frames::Mac(migsupport::kGwMac);
-  auto out = [&](const char* da) { return FrameBuilder().Eth(gw, vm).Ipv4(Ip4("10.0.0.1"), Ip4(da)); };
+  auto out = [&](const char* da) {
+    return FrameBuilder().Eth(gw, vm).Ipv4(Ip4("10.0.0.1"), Ip4(da));
+  };
   return {out("10.0.0.2").Tcp(1000, 80).Payload(40).Build(),
           out("10.0.0.3").Udp(53, 53).Payload(20).Build(),
-          out("10.1.0.5").Tcp(5, 6).Payload(10).Build(),
-          out("10.2.0.5").Udp(5, 6).Build(),
+          out("10.1.0.5").Tcp(5, 6).Payload(10).Build(), out("10.2.0.5").Udp(5, 6).Build(),
           out("10.9.9.9").Udp(5, 6).Build()};
 }
 
@@ -215,8 +218,8 @@ TEST_F(MigrationStressTest, EverythingAtOnceLeavesNothingBehind) {
       }
       if (!state.empty()) {
         std::shared_lock<std::shared_mutex> hold(slots_[to].mu);
-        const ZelStatus status = SLCGenericRestoreState(Filter(slots_[to].id), state.data(),
-                                                        state.size());
+        const ZelStatus status =
+            SLCGenericRestoreState(Filter(slots_[to].id), state.data(), state.size());
         // Busy with another restore or a save, or the restore request was
         // refused: all fine; anything else is not.
         EXPECT_TRUE(status == ZEL_OK || status == ZEL_FAILURE) << status;
@@ -257,11 +260,11 @@ TEST_F(MigrationStressTest, EverythingAtOnceLeavesNothingBehind) {
   EXPECT_GT(restored.load(), 0u);
   EXPECT_GT(recreated.load(), 0u);
   EXPECT_GT(churned.load(), 0u);
-  std::printf("delivered %lu, saved %lu, restored %lu, filters recreated %lu, slow path churn %lu\n",
-              static_cast<unsigned long>(delivered.load()), static_cast<unsigned long>(saved.load()),
-              static_cast<unsigned long>(restored.load()),
-              static_cast<unsigned long>(recreated.load()),
-              static_cast<unsigned long>(churned.load()));
+  std::printf(
+      "delivered %lu, saved %lu, restored %lu, filters recreated %lu, slow path churn %lu\n",
+      static_cast<unsigned long>(delivered.load()), static_cast<unsigned long>(saved.load()),
+      static_cast<unsigned long>(restored.load()), static_cast<unsigned long>(recreated.load()),
+      static_cast<unsigned long>(churned.load()));
 }
 
 }  // namespace

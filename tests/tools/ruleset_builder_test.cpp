@@ -12,9 +12,9 @@ using rules::ParseRule;
 TEST(RuleText, ExampleLineSetsWireFields) {
   FWRule r = ParseRule(
       "action=drop dir=to ipv4 proto=6 sa=10.0.0.1 da=10.0.0.2 sport=1234 dport=80  # web");
-  EXPECT_EQ(r.action, 1u);
+  EXPECT_EQ(+r.action, 1u);
   EXPECT_EQ(r.direction, 2u);
-  EXPECT_EQ(r.ruleFlags,
+  EXPECT_EQ(+r.ruleFlags,
             FW_WC_DMAC | FW_WC_SMAC | FW_WC_ETHTYPE | FW_WC_VLAN | FW_WC_RPTAG | FW_FLAG_IPV4);
   EXPECT_EQ(r.ipProto, 6);
   const uint8_t sa[4] = {10, 0, 0, 1}, da[4] = {10, 0, 0, 2};
@@ -31,11 +31,11 @@ TEST(RuleText, FullySpecifiedRuleIsExact) {
       "action=accept dir=from dmac=02:00:00:00:00:01 smac=02:00:00:00:00:02 ethtype=0x0800 "
       "vlan=100/5 sa=10.0.0.1 da=10.0.0.2 proto=udp sport=53 dport=5353 rptag=7 bidir");
   EXPECT_TRUE(rules::IsExactRule(r));
-  EXPECT_EQ(r.ruleFlags, FW_FLAG_IPV4);
+  EXPECT_EQ(+r.ruleFlags, FW_FLAG_IPV4);
   const uint8_t vlan[4] = {0x81, 0x00, 0xa0, 0x64};
   EXPECT_EQ(std::memcmp(r.vlan1QTag, vlan, 4), 0);
   EXPECT_EQ(FWNet16(r.ethType), 0x0800);
-  EXPECT_EQ(r.rpTag, 7);
+  EXPECT_EQ(+r.rpTag, 7);
   EXPECT_EQ(r.bidirectional, 1);
   EXPECT_EQ(r.ipProto, 17);
 }
@@ -44,25 +44,25 @@ TEST(RuleText, RangesMasksAndNegationsUseTheirOwnBits) {
   FWRule r = ParseRule(
       "ipv6 sa=!2001:db8::1-2001:db8::9 da=2001:db8::20 sport=!100-200 dport=!443 "
       "dmac=02:11:22:00:00:00/ff:ff:ff:00:00:00 smac=!02:00:00:00:00:09 vlan=none");
-  EXPECT_EQ(r.ruleFlags & FW_FLAG_IPV4, 0u);
-  EXPECT_EQ(r.ruleFlags & (FW_RANGE_IPSA | FW_RANGE_IPDA | FW_RANGE_SPORT | FW_RANGE_DPORT),
+  EXPECT_EQ(+r.ruleFlags & FW_FLAG_IPV4, 0u);
+  EXPECT_EQ(+r.ruleFlags & (FW_RANGE_IPSA | FW_RANGE_IPDA | FW_RANGE_SPORT | FW_RANGE_DPORT),
             FW_RANGE_IPSA | FW_RANGE_SPORT);
-  EXPECT_EQ(r.ruleFlags & (FW_MASK_DMAC | FW_MASK_SMAC), FW_MASK_DMAC);
+  EXPECT_EQ(+r.ruleFlags & (FW_MASK_DMAC | FW_MASK_SMAC), FW_MASK_DMAC);
   // Source address is negation bit 5, source port bit 8, destination port 7.
-  EXPECT_EQ(r.negateFlags, FW_NEG_IPSA | FW_NEG_SPORT | FW_NEG_DPORT | FW_NEG_SMAC);
+  EXPECT_EQ(+r.negateFlags, FW_NEG_IPSA | FW_NEG_SPORT | FW_NEG_DPORT | FW_NEG_SMAC);
   EXPECT_EQ(r.ipSaHigh[15], 9);
   EXPECT_EQ(FWNet16(r.sPortHigh), 200);
   EXPECT_EQ(r.dMacMask[2], 0xff);
   EXPECT_EQ(r.dMacMask[3], 0x00);
   EXPECT_EQ(FWNet32(r.vlan1QTag), 0u);
-  EXPECT_EQ(r.ruleFlags & FW_WC_VLAN, 0u);
+  EXPECT_EQ(+r.ruleFlags & FW_WC_VLAN, 0u);
 }
 
 TEST(RuleText, StarIsWildcardAndDefaultsAreAcceptBoth) {
   FWRule r = ParseRule("sa=10.0.0.1 sa=* dport=*");
-  EXPECT_EQ(r.action, SLCGenericActionAccept);
+  EXPECT_EQ(+r.action, SLCGenericActionAccept);
   EXPECT_EQ(r.direction, SLCGenericDirectionBidirectional);
-  EXPECT_EQ(r.ruleFlags, FW_WC_ALL | FW_FLAG_IPV4);
+  EXPECT_EQ(+r.ruleFlags, FW_WC_ALL | FW_FLAG_IPV4);
 }
 
 TEST(RuleText, ErrorsNameTheToken) {
@@ -93,9 +93,9 @@ TEST(RulesetBytes, Version7WritesPrefixRecordsWithBit9Clear) {
   EXPECT_EQ(h.version, 7);
   EXPECT_EQ(h.highestSupportedVersion, 8);
   EXPECT_EQ(h.lowestSupportedVersion, 7);
-  EXPECT_EQ(h.numRules, 2u);
-  EXPECT_EQ(h.fwFeatures, 3u);
-  EXPECT_EQ(h.fragOverride, 1u);
+  EXPECT_EQ(+h.numRules, 2u);
+  EXPECT_EQ(+h.fwFeatures, 3u);
+  EXPECT_EQ(+h.fragOverride, 1u);
   uint32_t flags;
   std::memcpy(&flags, bytes.data() + 15 + 4, 4);
   EXPECT_EQ(flags & FW_WC_RPTAG, 0u);
@@ -154,10 +154,9 @@ TEST(RulesetRoundTrip, ArbitraryFlagWordsSurviveText) {
     FWRule r = ParseRule("sa=10.0.0.1-10.0.0.9 dport=5 smac=02:00:00:00:00:01/ff:00:00:00:00:00");
     r.ruleFlags = rng();
     r.negateFlags = rng();
-    // Fields that a rule wildcards are written as zero; keep them so.
-    FWRule expect = ParseRule(rules::FormatRule(r));
-    EXPECT_EQ(expect.ruleFlags, r.ruleFlags);
-    EXPECT_EQ(expect.negateFlags, r.negateFlags);
+    FWRule back = ParseRule(rules::FormatRule(r));
+    EXPECT_EQ(+back.ruleFlags, +r.ruleFlags);
+    EXPECT_EQ(+back.negateFlags, +r.negateFlags);
   }
 }
 
