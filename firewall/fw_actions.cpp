@@ -16,8 +16,9 @@ constexpr uint32_t kGreHeaderLen = 4;
 // No flags, version 0, protocol 0x6558 (transparent Ethernet bridging).
 constexpr uint8_t kGreHeader[kGreHeaderLen] = {0x00, 0x00, 0x65, 0x58};
 
-// States of FWRuleEntry::greSocketOpen. Outside a walk only 0 and 1 are
-// ever seen: entries are copied, saved and freed under the exclusive hold.
+// States of FWRuleEntry::greSocketOpen. Only walks, which share configLock,
+// can see "opening"; the code that copies and frees entries (and so reads
+// the flag elsewhere) holds configLock exclusively, when no walk runs.
 constexpr uint8_t kGreSocketClosed = 0;
 constexpr uint8_t kGreSocketOpen = 1;
 constexpr uint8_t kGreSocketOpening = 2;  // one walk is creating it

@@ -11,7 +11,10 @@
 // Cost: per packet the walk makes only the getter calls it needs (frame
 // length, mapped length and pointer, VLAN ID and priority), reads headers in
 // place from the mapped part, and asks the scatter-gather array only for
-// bytes beyond it. Nothing is allocated except what an action needs.
+// bytes beyond it. Nothing is allocated except what an action needs; the
+// iterators and local lists live on the stack. Large exact tables switch the
+// walk to a pipelined shape that overlaps their cache misses (see
+// FWWalkList).
 
 #include "firewall/fw_packet.h"
 #include "module/locks.h"
@@ -110,10 +113,10 @@ static_assert(FW_TUPLE_V6_IPDA == FW_TUPLE_IPSA + 16);
 static_assert(FW_TUPLE_V4_SPORT == FW_TUPLE_V4_PROTO + 1 && FW_TUPLE_V4_DPORT == FW_TUPLE_V4_PROTO + 3);
 static_assert(FW_TUPLE_V6_SPORT == FW_TUPLE_V6_PROTO + 1 && FW_TUPLE_V6_DPORT == FW_TUPLE_V6_PROTO + 3);
 
-inline uint8_t* SummaryBytes(FWPktSummary* s, size_t member) {
+inline uint8_t* FWSummaryBytes(FWPktSummary* s, size_t member) {
   return reinterpret_cast<uint8_t*>(s) + member;
 }
-inline const uint8_t* SummaryBytes(const FWPktSummary* s, size_t member) {
+inline const uint8_t* FWSummaryBytes(const FWPktSummary* s, size_t member) {
   return reinterpret_cast<const uint8_t*>(s) + member;
 }
 
@@ -205,7 +208,7 @@ __attribute__((always_inline)) inline void FWParseFrame(ZelPkt* pkt,
                                       static_cast<uint32_t>(l4 + (udp ? 8 : 4)));
       }
       if (ports != nullptr) {
-        __builtin_memcpy(SummaryBytes(s, offsetof(FWPktSummary, sPort)), ports, 4);
+        __builtin_memcpy(FWSummaryBytes(s, offsetof(FWPktSummary, sPort)), ports, 4);
         presence |= FW_PKT_PORTS | (udp ? FW_PKT_UDP : FW_PKT_TCP);
       }
     }
@@ -221,15 +224,15 @@ __attribute__((always_inline)) inline uint64_t FWTupleFromSummary(
   const uint8_t* macs = s->dMac;  // sMac follows in the frame
   const uint8_t* sa = s->ipSa;    // ipDa follows in the frame
   __builtin_memcpy(t + FW_TUPLE_DMAC, macs, 12);
-  __builtin_memcpy(t + FW_TUPLE_ETHTYPE, SummaryBytes(s, offsetof(FWPktSummary, ethType)), 6);
+  __builtin_memcpy(t + FW_TUPLE_ETHTYPE, FWSummaryBytes(s, offsetof(FWPktSummary, ethType)), 6);
   if (s->presence & FW_PKT_IPV4) {
     __builtin_memcpy(t + FW_TUPLE_IPSA, sa, 8);
-    __builtin_memcpy(t + FW_TUPLE_V4_PROTO, SummaryBytes(s, offsetof(FWPktSummary, ipProto)), 5);
+    __builtin_memcpy(t + FW_TUPLE_V4_PROTO, FWSummaryBytes(s, offsetof(FWPktSummary, ipProto)), 5);
     tuple->isIPv4 = 1;
     return HashFunc_HashBytes(t, FW_TUPLE_V4_HASHED);
   }
   __builtin_memcpy(t + FW_TUPLE_IPSA, sa, 32);
-  __builtin_memcpy(t + FW_TUPLE_V6_PROTO, SummaryBytes(s, offsetof(FWPktSummary, ipProto)), 5);
+  __builtin_memcpy(t + FW_TUPLE_V6_PROTO, FWSummaryBytes(s, offsetof(FWPktSummary, ipProto)), 5);
   tuple->isIPv4 = 0;
   return HashFunc_HashBytes(t, FW_TUPLE_V6_HASHED);
 }
@@ -339,9 +342,10 @@ inline uint32_t FWOverrideAction(uint32_t fragOverride) {
 // inserted, so the iterator ahead and the parsed slots stay valid and the
 // main iterator reaches each slot's packet in order. Parsing a packet early
 // changes nothing: packets ahead are not touched by the current verdict.
-constexpr uint32_t kRingSize = 8;  // power of two, > kParseAhead
-constexpr uint32_t kParseAhead = 6;
-constexpr uint32_t kEntryAhead = 3;
+// The ring takes kRingSize * 144 bytes (2.3 KiB) of the walk's stack.
+constexpr uint32_t kRingSize = 16;  // power of two, > kParseAhead
+constexpr uint32_t kParseAhead = 8;
+constexpr uint32_t kEntryAhead = 4;
 static_assert((kRingSize & (kRingSize - 1)) == 0 && kParseAhead < kRingSize &&
               kEntryAhead < kParseAhead);
 // Tables with more buckets than this (more than 16384 exact rules) take the
@@ -357,6 +361,7 @@ struct FWParsedPkt {
   FWPktSummary summary;
   FWRuleTuple tuple;        // with ports
 };
+static_assert(sizeof(FWParsedPkt) == 144);
 
 // The exact-rule table as the walk reads it; fixed for the walk.
 struct FWTableView {
@@ -403,24 +408,38 @@ __attribute__((always_inline)) inline void FWPrefetchEntry(const FWParsedPkt* sl
   __builtin_prefetch(e + 128);
 }
 
+// Rule counters are plain adds under the shared hold: walks on other
+// processors may count on the same rule at once and lose an increment, which
+// statistics can afford (an atomic add per packet would cost more than the
+// rest of the lookup). The race is intended, so it is kept out of the thread
+// sanitizer's reports.
+__attribute__((no_sanitize("thread"))) inline void FWCountHit(FWRuleEntry* entry,
+                                                              uint32_t frameLen) {
+  entry->rule.pktCount += 1;
+  entry->rule.byteCount += frameLen;
+}
+
 // Decides the packet of `cur`, which the main iterator stands on, and
-// leaves the iterator on the next packet.
-__attribute__((always_inline)) inline void FWDecide(FWWalk* walk, FWParsedPkt* cur,
+// leaves the iterator on the next packet. `early` tells that the ruleset has
+// feature bits or a fragment override, which may decide before the lookup.
+__attribute__((always_inline)) inline void FWDecide(FWWalk* walk, FWParsedPkt* cur, bool early,
                                                     bool haveGeneralRules) {
   FWFilterContext* ctx = walk->ctx;
   ZelPkt* pkt = cur->pkt;
   const FWPktSummary* summary = &cur->summary;
   const uint32_t direction = walk->direction;
 
-  if (__builtin_expect(ctx->fwFeatures != 0, 0) &&
-      FWProcessFeatures(ctx, pkt, summary, direction) == SLCGenericActionDrop) {
-    FWDropCurrent(walk);
-    return;
-  }
-  if (__builtin_expect((summary->presence & (FW_PKT_FIRST_FRAG | FW_PKT_LATER_FRAG)) != 0, 0) &&
-      ctx->fragOverride != 0) {
-    FWApplyAction(walk, pkt, FWOverrideAction(ctx->fragOverride), nullptr, summary);
-    return;
+  if (__builtin_expect(early, 0)) {
+    if (ctx->fwFeatures != 0 &&
+        FWProcessFeatures(ctx, pkt, summary, direction) == SLCGenericActionDrop) {
+      FWDropCurrent(walk);
+      return;
+    }
+    if ((summary->presence & (FW_PKT_FIRST_FRAG | FW_PKT_LATER_FRAG)) != 0 &&
+        ctx->fragOverride != 0) {
+      FWApplyAction(walk, pkt, FWOverrideAction(ctx->fragOverride), nullptr, summary);
+      return;
+    }
   }
 
   FWRuleEntry* entry = nullptr;
@@ -434,10 +453,7 @@ __attribute__((always_inline)) inline void FWDecide(FWWalk* walk, FWParsedPkt* c
     zel_PktListIterMove(walk->iter);
     return;
   }
-  // Plain adds under the shared hold: concurrent walks on one rule may lose
-  // an increment.
-  entry->rule.pktCount += 1;
-  entry->rule.byteCount += cur->frameLen;
+  FWCountHit(entry, cur->frameLen);
   const uint32_t action = entry->rule.action;
   if (action == SLCGenericActionAccept) {  // the common verdict, without the dispatch
     zel_PktListIterMove(walk->iter);
@@ -453,6 +469,7 @@ void FWWalkList(FWWalk* walk, ZelPktList* list, ZelPktListIter* ahead) {
   const FWTableView table = {ctx->ruleHash->buckets, ctx->ruleHash->numBuckets - 1};
   const uint32_t fragOverride = ctx->fragOverride;
   const bool haveGeneralRules = !List_IsEmpty(&ctx->ruleList);
+  const bool early = ctx->fwFeatures != 0 || fragOverride != 0;
   ZelPktListIter* iter = walk->iter;
   zel_PktListIterStart(list, iter);
 
@@ -460,7 +477,7 @@ void FWWalkList(FWWalk* walk, ZelPktList* list, ZelPktListIter* ahead) {
     FWParsedPkt cur;
     while (!zel_PktListIterIsAtEnd(iter)) {
       FWParseInto<false>(zel_PktListIterGetPkt(iter), &cur, fragOverride, table);
-      FWDecide(walk, &cur, haveGeneralRules);
+      FWDecide(walk, &cur, early, haveGeneralRules);
     }
     return;
   }
@@ -483,7 +500,7 @@ void FWWalkList(FWWalk* walk, ZelPktList* list, ZelPktListIter* ahead) {
     if (parsed - done > kEntryAhead) {
       FWPrefetchEntry(&ring[(done + kEntryAhead) & (kRingSize - 1)]);
     }
-    FWDecide(walk, &ring[done++ & (kRingSize - 1)], haveGeneralRules);
+    FWDecide(walk, &ring[done++ & (kRingSize - 1)], early, haveGeneralRules);
   }
 }
 

@@ -7,10 +7,10 @@
 namespace {
 
 std::vector<uint8_t> Message(uint32_t type, uint32_t word, const std::vector<uint8_t>& tail) {
-  std::vector<uint8_t> m(8);
+  std::vector<uint8_t> m(8 + tail.size());
   std::memcpy(m.data(), &type, 4);
   std::memcpy(m.data() + 4, &word, 4);
-  m.insert(m.end(), tail.begin(), tail.end());
+  if (!tail.empty()) std::memcpy(m.data() + 8, tail.data(), tail.size());
   return m;
 }
 

@@ -86,7 +86,7 @@ TEST_F(GreAction, OneNonBlockingSocketPerRuleEntryAndAProgressLogPerPacket) {
   for (uint64_t s : {sent[0].socket, sent[1].socket}) {
     EXPECT_EQ(host::Sockets::Options(s), (std::vector<std::array<int32_t, 3>>{{0xffff, 0x1015, 1}}));
   }
-  EXPECT_EQ(Exact(ExactTcp4("gre", 1, 1))->rule.pktCount, 3u);
+  EXPECT_EQ(Pkts(Exact(ExactTcp4("gre", 1, 1))), 3u);
 
   // The socket lives as long as its entry.
   ApplyText(ExactTcp4("accept"));
@@ -137,7 +137,7 @@ TEST_F(GreAction, BufferOrElementFailuresSendNothingAndLeakNothing) {
   host::Faults::Fail("zel_MA2VA", ZEL_BAD_PARAM);
   RunOne(Spec(Tcp4()));
   EXPECT_TRUE(host::Sockets::Sent().empty());
-  EXPECT_EQ(Exact(ExactTcp4("gre"))->rule.pktCount, 4u);
+  EXPECT_EQ(Pkts(Exact(ExactTcp4("gre"))), 4u);
 }
 
 TEST_F(GreAction, ConcurrentWalksOpenTheSocketOnce) {

@@ -118,6 +118,10 @@ class PacketPathTest : public testsupport::FirewallTest {
   std::vector<Handed> Faulted() { return Frames(host::Sluice::TakeFaulted(id_)); }
   std::vector<Handed> Issued() { return Frames(host::Sluice::TakeIssued(id_)); }
 
+  // Counters by value (the record is packed: no references into it).
+  static uint64_t Pkts(const FWRuleEntry* e) { return e->rule.pktCount; }
+  static uint64_t Octets(const FWRuleEntry* e) { return e->rule.byteCount; }
+
   // The installed rule entries, exact ones first.
   FWRuleEntry* Exact(std::string_view line) { return FindExact(rules::ParseRule(line)); }
   FWRuleEntry* General(size_t index) {

@@ -74,6 +74,9 @@ TEST_F(PacketParse, EthernetShapesPlaceTheEtherTypeAndL3) {
       {"802.3 LLC/SNAP", Base().Llc().Ipv4(sa, da).Udp(1, 2), 22},
       {"802.1Q", Base().Vlan(5).Ipv4(sa, da).Udp(1, 2), 18},
       {"802.1Q over 802.3", Base().Vlan(5).Llc().Ipv4(sa, da).Udp(1, 2), 26},
+      {"802.3 length 1500", Base().Llc().LlcLength(1500).Ipv4(sa, da).Udp(1, 2), 22},
+      {"802.1Q over 802.3 length 1500",
+       Base().Vlan(5).Llc().LlcLength(1500).Ipv4(sa, da).Udp(1, 2), 26},
   };
   for (L2Case& c : cases) {
     SCOPED_TRACE(c.name);
@@ -85,7 +88,12 @@ TEST_F(PacketParse, EthernetShapesPlaceTheEtherTypeAndL3) {
     EXPECT_EQ(Port(s.sPort), 1);
     EXPECT_EQ(Port(s.dPort), 2);
   }
-  // Any other EtherType stops after L2.
+  // 1501 is no 802.3 length, and like any other EtherType stops after L2.
+  FWPktSummary odd = Parse(Base().EtherType(1501).Payload(40).Build());
+  EXPECT_EQ(odd.presence, FW_PKT_RPTAG | FW_PKT_L2);
+  EXPECT_EQ(FWNet16(odd.ethType), 1501);
+  odd = Parse(Base().Vlan(5).EtherType(1501).Payload(40).Build());
+  EXPECT_EQ(FWNet16(odd.ethType), 1501);
   FWPktSummary arp = Parse(Base()
                                .Arp(1, kSrcMac, frames::Ip4("10.0.0.1"), {},
                                     frames::Ip4("10.0.0.2"))
