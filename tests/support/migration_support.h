@@ -1,14 +1,16 @@
 // Helpers for the migration tests: exact rules in the ruleset builder's
-// text, saved-state buffers and their header fields, and the module-side steps a
-// test repeats (installing rules, reading them back, a whole save).
+// text, saved-state buffers and their header fields, and a fixture for the
+// module-side steps a test repeats (filters, slow paths, request policies).
 #pragma once
 
-#include <cstdint>
-#include <string>
-#include <vector>
+#include <cstdlib>
+#include <cstring>
 
 #include "firewall/firewall.h"
 #include "migration/migration.h"
+#include "module/locks.h"
+#include "tests/support/module_fixture.h"
+#include "tools/lib/ruleset_builder.h"
 
 namespace migsupport {
 
@@ -17,47 +19,107 @@ using Bytes = std::vector<uint8_t>;
 inline constexpr const char* kVmMac = "02:00:00:00:00:01";
 inline constexpr const char* kGwMac = "02:00:00:00:00:02";
 
-// The text of an exact IPv4 rule (ruleset builder syntax) for traffic that
-// leaves the VM (direction 2): kVmMac to kGwMac, untagged, every field given.
-// `extra` adds tokens ("bidir", "pkts=5").
-std::string ExactRule(const char* action, const char* proto, const char* sa, int sport,
-                      const char* da, int dport, const char* extra = "");
+// An exact IPv4 rule for traffic leaving the VM (kVmMac to kGwMac, untagged).
+inline std::string ExactRule(const char* action, const char* proto, const char* sa, int sport,
+                             const char* da, int dport) {
+  return std::string("action=") + action + " dir=to ipv4 dmac=" + kGwMac + " smac=" + kVmMac +
+         " ethtype=0x0800 vlan=none proto=" + proto + " sa=" + sa + " da=" + da +
+         " sport=" + std::to_string(sport) + " dport=" + std::to_string(dport);
+}
 
-// The rule records of a wire ruleset, each of its version's size.
-std::vector<Bytes> Records(const Bytes& ruleset);
+// One exact and one general rule: 15 + 2 * 281 = 577 bytes in version 8.
+inline Bytes SampleRules(uint8_t version = 8) {
+  return rules::RulesetBuilder(version)
+      .Add(ExactRule("drop", "tcp", "10.0.0.1", 1000, "10.0.0.2", 80))
+      .Add("action=punt ipv4 ethtype=0x0800 proto=udp da=10.9.0.0-10.9.0.255")
+      .Bytes();
+}
+
+inline Bytes Pattern(size_t n, uint8_t first = 1) {
+  Bytes b(n);
+  for (size_t i = 0; i < n; i++) b[i] = static_cast<uint8_t>(first + i * 7);
+  return b;
+}
 
 // Header field offsets in the saved-state buffer.
-inline constexpr size_t kMagicAt = 0;
-inline constexpr size_t kVersionAt = 8;
-inline constexpr size_t kFastOffsetAt = 16;
-inline constexpr size_t kFastLengthAt = 24;
-inline constexpr size_t kSlowOffsetAt = 32;
-inline constexpr size_t kSlowLengthAt = 40;
+inline constexpr size_t kVersionAt = 8, kFastOffsetAt = 16, kFastLengthAt = 24, kSlowOffsetAt = 32,
+                        kSlowLengthAt = 40;
 
-uint64_t GetU64(const Bytes& b, size_t at);
-void PutU64(Bytes* b, size_t at, uint64_t v);
-uint32_t GetU32(const Bytes& b, size_t at);
+inline void PutU64(Bytes* b, size_t at, uint64_t v) { std::memcpy(b->data() + at, &v, sizeof(v)); }
 
 // A well-formed saved state: header, `fast`, then `slow`, no gaps.
-Bytes SavedState(const Bytes& fast, const Bytes& slow = {});
+inline Bytes SavedState(const Bytes& fast, const Bytes& slow = {}) {
+  Bytes out(kSLCGenericSaveMagic, kSLCGenericSaveMagic + 8);
+  out.resize(sizeof(SLCGenericStateHeader));
+  const uint64_t fields[] = {kSLCGenericStateVersion, 48, fast.size(), 48 + fast.size(),
+                             slow.size()};
+  for (size_t i = 0; i < std::size(fields); i++) PutU64(&out, kVersionAt + 8 * i, fields[i]);
+  out.insert(out.end(), fast.begin(), fast.end());
+  out.insert(out.end(), slow.begin(), slow.end());
+  return out;
+}
 
-// Installs `ruleset` as a property write would (not from ioctl), replacing
-// or adding to the rules in force, holding configLock for writing.
-ZelStatus Install(SLCGenericFilter* filter, const Bytes& ruleset, uint32_t replace = 1);
-// The filter's ruleset as FWPopulateRuleset writes it, exactly
-// 15 + numRules * size(version) bytes.
-Bytes Rules(SLCGenericFilter* filter);
+// Installs `ruleset` as a property write would, holding configLock.
+inline ZelStatus Install(SLCGenericFilter* filter, Bytes ruleset, uint32_t replace = 1) {
+  SLCGenericWriteGuard config(FWContext(filter)->configLock);
+  return FWApplyRuleset(filter, reinterpret_cast<FWRuleset*>(ruleset.data()), replace, 0);
+}
 
-// Length request, then a save into a buffer of exactly that size.
-struct SaveResult {
-  ZelStatus lenStatus = ZEL_OK;
-  ZelStatus saveStatus = ZEL_OK;
-  Bytes bytes;
+// The filter's ruleset as FWPopulateRuleset writes it, records of its version's size.
+inline Bytes Rules(SLCGenericFilter* filter) {
+  FWFilterContext* ctx = FWContext(filter);
+  SLCGenericReadGuard config(ctx->configLock);
+  Bytes out(FW_RULESET_HEADER_SIZE + size_t{FW_RULE_SIZE_V8} * ctx->numRules);
+  FWPopulateRuleset(ctx, reinterpret_cast<FWRuleset*>(out.data()));
+  const size_t size = ctx->version == FW_RULESET_VERSION_7 ? FW_RULE_SIZE_V7 : FW_RULE_SIZE_V8;
+  out.resize(FW_RULESET_HEADER_SIZE + size * ctx->numRules);
+  return out;
+}
+
+// Length request, then a save into a buffer of exactly that size; empty on failure.
+inline Bytes Save(SLCGenericFilter* filter) {
+  uint64_t len = 0;
+  if (SLCGenericGetSavedStateLen(filter, &len) != ZEL_OK) return {};
+  Bytes out(len, 0xA5);
+  if (SLCGenericSaveState(filter, out.data(), &len) != ZEL_OK) return {};
+  out.resize(len);
+  return out;
+}
+
+// A filter's reference count and migration state, read under its lock.
+struct RefsAndState {
+  uint32_t refs, state;
+  bool operator==(const RefsAndState&) const = default;
 };
-SaveResult Save(SLCGenericFilter* filter);
+inline RefsAndState Of(SLCGenericFilter* filter) {
+  SLCGenericSpinGuard guard(filter->lock);
+  return {filter->refCount, filter->migrationState};
+}
+// Nothing in flight: the framework's reference only.
+inline constexpr RefsAndState kIdle{1, SLCGenericStateIdle};
 
-// Locked reads of the filter's (L) fields.
-uint32_t RefCount(SLCGenericFilter* filter);
-uint32_t MigrationState(SLCGenericFilter* filter);
+inline uint64_t EnvOr(const char* name, uint64_t fallback) {
+  const char* v = std::getenv(name);
+  return v != nullptr ? std::strtoull(v, nullptr, 0) : fallback;
+}
+
+class MigrationTest : public testsupport::ModuleTest {
+ protected:
+  host::FilterId NewFilter(const std::string& name, uint32_t failurePolicy = 0) {
+    host::FilterConfig config;
+    config.name = name;
+    config.failurePolicy = failurePolicy;
+    return CreateFilter(testsupport::kDefaultAgent, config);
+  }
+  // Registers a slow path and runs the attach timer.
+  void AttachSlowPath(uint32_t slowPathId) {
+    ASSERT_EQ(host::Sluice::RegisterSlowPath(testsupport::kDefaultAgent, slowPathId), ZEL_OK);
+    host::Timers::RunDue();
+  }
+  static void SetPolicy(host::RequestKind kind, host::ReplyMode mode, Bytes data = {},
+                        ZelStatus replyStatus = ZEL_OK, ZelStatus refuse = ZEL_OK) {
+    host::Sluice::SetPolicy(kind, {refuse, mode, replyStatus, std::move(data)});
+  }
+};
 
 }  // namespace migsupport
