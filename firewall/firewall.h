@@ -23,6 +23,9 @@ struct FWRuleEntry {
 };
 static_assert(offsetof(FWRuleEntry, link) == 0);
 
+// The general rules' scan index (fw_index.h).
+struct FWScanIndex;
+
 struct FWFilterContext {
   SLCGenericFilter* filter;
   ZelLock* configLock;         // rank 4, reader/writer; guards all below
@@ -35,6 +38,8 @@ struct FWFilterContext {
   uint32_t fwFeatures;
   uint32_t numRules;           // installed entries, exact and general
   uint32_t ioctl;              // 1 once a ruleset came by an ioctl road; never cleared
+  FWScanIndex* scanIndex;      // the entries of ruleList in ruleset order, for the scan;
+                               // rebuilt with ruleList, owned by the context
 };
 
 inline FWFilterContext* FWContext(SLCGenericFilter* filter) {

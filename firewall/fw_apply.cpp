@@ -9,9 +9,10 @@
 //   - add: the former table is copied into the new one (copies share the
 //     originals' sockets and tags; whichever record survives owns them) and
 //     the new general rules are linked in front of the former ones.
-// Success releases what was replaced (or only the memory of the originals
-// when adding). Undo releases what this application created and restores
-// the snapshot.
+// Success installs a new scan index of the general rules (fw_index.h),
+// allocated last, and releases what was replaced (or only the memory of the
+// originals when adding). Undo releases what this application created and
+// restores the snapshot (the former index with it).
 //
 // Resource-pool tags. Every tag obtained from the host is handed back
 // exactly once, so that undoing or re-applying rulesets never leaks one:
@@ -31,7 +32,7 @@
 // Every function here runs with the filter's configLock held exclusively,
 // except FWPopulateRuleset (shared suffices).
 
-#include "firewall/fw_rules.h"
+#include "firewall/fw_index.h"
 
 namespace {
 
@@ -243,7 +244,18 @@ ZelStatus FWApplyRuleset(SLCGenericFilter* filter, FWRuleset* ruleset, uint32_t 
     ok = FWInstallRecord(filter, ctx, &work, &k);
   }
 
+  // The scan index of the general rules as they now stand (the former ones
+  // first when adding); the former index stays in force until success.
+  FWScanIndex* index = nullptr;
+  if (ok && FWScanIndexBuild(&ctx->ruleList, &index) != ZEL_OK) {
+    SLCG_LOG_OBJ(SLCG_ATTENTION, filter->name, "Failed to allocate general rule index");
+    ok = false;
+  }
+
   if (ok) {
+    FWScanIndex* former = snapshot.scanIndex;
+    FWScanIndexFree(&former);
+    ctx->scanIndex = index;
     if (snapshot.ruleHash != nullptr) {
       // Adding: the copies now own sockets and tags. Replacing: the former
       // entries go with everything they own.
@@ -291,6 +303,7 @@ void FWPopulateRuleset(FWFilterContext* ctx, FWRuleset* ruleset) {
 void FWClearRules(FWFilterContext* ctx) {
   ctx->numRules = 0;
   ctx->fwFeatures = 0;
+  FWScanIndexFree(&ctx->scanIndex);
   FWDestroyHash(&ctx->ruleHash);
   FWReleaseList(&ctx->ruleList);
 }

@@ -17,6 +17,7 @@
 // state query holds it shared while it copies; every reply is sent after the
 // lock is released.
 #include "firewall/fw_ioctl.h"
+#include "firewall/fw_index.h"
 
 #include "module/locks.h"
 
@@ -189,6 +190,8 @@ uint32_t ClearSingleRules(SLCGenericFilter* filter, FWFilterContext* ctx, const 
     }
     if (method == FWClearMethodRemove) {
       // numRules is deliberately not lowered: it counts what was installed.
+      // A general entry leaves the scan index first (no allocation).
+      FWScanIndexForget(ctx->scanIndex, entry);
       List_Remove(&entry->link);
       FWRuleEntryFree(entry);
     } else if (method == FWClearMethodStats) {

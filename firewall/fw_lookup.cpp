@@ -1,54 +1,38 @@
 // The general-rule scan: the first rule of ruleList, in ruleset order, that
 // matches a packet summary.
 //
-// This runs for every packet that no exact rule accepted, once per general
-// rule, so each test is a few word operations:
+// This runs for every packet that no exact rule accepted, over every general
+// rule up to the match, so the per-rule cost is what counts:
 //   - the packet's fields are decoded once per scan into words (MACs
 //     zero-extended to 8 bytes, addresses both as stored and in numeric
-//     order), so a rule test only loads the rule's side;
-//   - the first test is the presence mask, which rejects a rule that
-//     compares a field the packet lacks before any field is read; a field
-//     that the packet lacks is therefore never compared, and its decoded
-//     word (left 0) never matters;
-//   - each field test yields d = 1 when the packet differs from (or lies
-//     outside) the rule and requires d to equal the field's negation bit.
+//     order), and packed into the four key words of the scan index;
+//   - the scan walks the index (fw_index.h), a contiguous array of 64-byte
+//     slots in ruleset order, and tests each slot with four masked
+//     compares and one branch; a slot that rejects the packet is a rule
+//     that the full test would reject, and rejects it before the full test
+//     would read the packet's resource-pool tag;
+//   - a slot that passes either is a match (its exact bit) or sends its
+//     rule through the full test, which runs the steps in their order on
+//     the installed record: presence, direction, MACs, ethertype, 802.1Q
+//     tag, addresses by family, protocol, resource-pool tag, then ports
+//     unless the packet has none; each field test yields d = 1 when the
+//     packet differs from (or lies outside) the rule and requires d to
+//     equal the field's negation bit.
+// A packet whose direction is neither 1 nor 2, or that presents an address
+// without being IPv4 or IPv6, is outside what the key words encode: its
+// scan runs the full test on every rule.
 //
 // Runs with configLock held shared; changes nothing, allocates nothing.
 
-#include "firewall/fw_rules.h"
+#include "firewall/fw_index.h"
 
 namespace {
-
-inline uint64_t Load64(const uint8_t* p) {
-  uint64_t v;
-  __builtin_memcpy(&v, p, sizeof(v));
-  return v;
-}
-inline uint32_t Load32(const uint8_t* p) {
-  uint32_t v;
-  __builtin_memcpy(&v, p, sizeof(v));
-  return v;
-}
-inline uint16_t Load16(const uint8_t* p) {
-  uint16_t v;
-  __builtin_memcpy(&v, p, sizeof(v));
-  return v;
-}
-
-constexpr uint64_t kMac48 = 0x0000ffffffffffffull;
 
 // A 6-byte MAC of the frame as a zero-extended word; nothing past the 6
 // bytes is read.
 inline uint64_t PacketMac(const uint8_t* p) {
-  return Load32(p) | (static_cast<uint64_t>(Load16(p + 4)) << 32);
+  return FWLoad32(p) | (static_cast<uint64_t>(FWLoad16(p + 4)) << 32);
 }
-// Rule side: every MAC and mask field of the record is followed by at least
-// two more bytes of the record, so one 8-byte load is safe.
-inline uint64_t RuleMac(const uint8_t* p) { return Load64(p) & kMac48; }
-static_assert(offsetof(FWRule, dMac) + 8 <= sizeof(FWRule));
-static_assert(offsetof(FWRule, sMac) + 8 <= sizeof(FWRule));
-static_assert(offsetof(FWRule, dMacMask) + 8 <= sizeof(FWRule));
-static_assert(offsetof(FWRule, sMacMask) + 8 <= sizeof(FWRule));
 
 // An address in both forms: as stored (equality) and as a big-endian
 // number (ranges). IPv4 uses hi only.
@@ -60,11 +44,11 @@ struct FWAddr {
 inline FWAddr PacketAddr(const uint8_t* p, bool v4) {
   FWAddr a{};
   if (v4) {
-    a.rawHi = Load32(p);
-    a.numHi = __builtin_bswap32(Load32(p));
+    a.rawHi = FWLoad32(p);
+    a.numHi = __builtin_bswap32(FWLoad32(p));
   } else {
-    a.rawHi = Load64(p);
-    a.rawLo = Load64(p + 8);
+    a.rawHi = FWLoad64(p);
+    a.rawLo = FWLoad64(p + 8);
     a.numHi = __builtin_bswap64(a.rawHi);
     a.numLo = __builtin_bswap64(a.rawLo);
   }
@@ -85,9 +69,9 @@ struct FWPacketWords {
 inline uint32_t NegBit(uint32_t negate, uint32_t bit) { return (negate & bit) != 0; }
 
 inline uint32_t MacDiffers(uint64_t pkt, const uint8_t* rule, const uint8_t* mask, bool masked) {
-  uint64_t b = RuleMac(rule);
+  uint64_t b = FWRuleMac(rule);
   if (masked) {
-    const uint64_t m = RuleMac(mask);
+    const uint64_t m = FWRuleMac(mask);
     pkt &= m;
     b &= m;
   }
@@ -96,145 +80,238 @@ inline uint32_t MacDiffers(uint64_t pkt, const uint8_t* rule, const uint8_t* mas
 
 // IPv4 ranges include both bounds.
 inline uint32_t V4AddrDiffers(const FWAddr& v, const uint8_t* lo, const uint8_t* hi, bool range) {
-  if (!range) return v.rawHi != Load32(lo);
-  return v.numHi < __builtin_bswap32(Load32(lo)) || v.numHi > __builtin_bswap32(Load32(hi));
+  if (!range) return v.rawHi != FWLoad32(lo);
+  return v.numHi < __builtin_bswap32(FWLoad32(lo)) || v.numHi > __builtin_bswap32(FWLoad32(hi));
 }
 
 // v < the 128-bit big-endian number at p.
 inline bool V6Less(const FWAddr& v, const uint8_t* p) {
-  const uint64_t hi = __builtin_bswap64(Load64(p));
-  return v.numHi < hi || (v.numHi == hi && v.numLo < __builtin_bswap64(Load64(p + 8)));
+  const uint64_t hi = __builtin_bswap64(FWLoad64(p));
+  return v.numHi < hi || (v.numHi == hi && v.numLo < __builtin_bswap64(FWLoad64(p + 8)));
 }
 
 // IPv6 ranges exclude the upper bound.
 inline uint32_t V6AddrDiffers(const FWAddr& v, const uint8_t* lo, const uint8_t* hi, bool range) {
-  if (!range) return ((v.rawHi ^ Load64(lo)) | (v.rawLo ^ Load64(lo + 8))) != 0;
+  if (!range) return ((v.rawHi ^ FWLoad64(lo)) | (v.rawLo ^ FWLoad64(lo + 8))) != 0;
   return V6Less(v, lo) || !V6Less(v, hi);
 }
 
 // Ranges include both bounds.
 inline uint32_t PortDiffers(uint16_t raw, uint16_t num, const uint8_t* lo, const uint8_t* hi,
                             bool range) {
-  if (!range) return raw != Load16(lo);
+  if (!range) return raw != FWLoad16(lo);
   return num < FWNet16(lo) || num > FWNet16(hi);
+}
+
+// One scan: the packet, its direction, the packet decoded for the full
+// test (on its first use) and its resource-pool tag (read at most once).
+struct FWScan {
+  const FWPktSummary* summary;
+  uint32_t presence;
+  uint32_t direction;
+  bool v4, v6, ports;
+  bool decoded;
+  bool haveTag;
+  uint16_t tag;
+  ZelPkt* pkt;
+  FWPacketWords p;
+};
+
+// Only fields whose presence bit is set are read from the summary; a field
+// the packet lacks is compared by no rule that passes step 1.
+void FWDecode(FWScan* s) {
+  const FWPktSummary* summary = s->summary;
+  FWPacketWords& p = s->p;
+  p = FWPacketWords{};
+  if (s->presence & FW_WC_DMAC) p.dMac = PacketMac(summary->dMac);
+  if (s->presence & FW_WC_SMAC) p.sMac = PacketMac(summary->sMac);
+  p.ethType = FWLoad16(summary->ethType);
+  p.vlan = FWLoad32(summary->vlan1QTag);
+  p.ipProto = summary->ipProto;
+  if (s->v4 || s->v6) {
+    if (s->presence & FW_WC_IPSA) p.sa = PacketAddr(summary->ipSa, s->v4);
+    if (s->presence & FW_WC_IPDA) p.da = PacketAddr(summary->ipDa, s->v4);
+  }
+  p.sPortRaw = FWLoad16(summary->sPort);
+  p.dPortRaw = FWLoad16(summary->dPort);
+  p.sPort = FWNet16(summary->sPort);
+  p.dPort = FWNet16(summary->dPort);
+  s->decoded = true;
+}
+
+// The full test of one rule, steps 1-13 in order.
+__attribute__((noinline)) bool FWRuleMatches(const FWRule& r, FWScan* s) {
+  if (!s->decoded) FWDecode(s);
+  const FWPacketWords& p = s->p;
+  const uint32_t f = r.ruleFlags;
+
+  // 1. Every field the rule does not wildcard must be present.
+  const uint32_t need = ~f & FW_WC_ALL;
+  if ((s->presence & need) != need) return false;
+  // 2. Direction (0 never equals a packet's 1 or 2).
+  if (r.direction != SLCGenericDirectionBidirectional && r.direction != s->direction) return false;
+
+  const uint32_t n = r.negateFlags;
+  // 3-6. L2 fields.
+  if (!(f & FW_WC_DMAC) &&
+      MacDiffers(p.dMac, r.dMac, r.dMacMask, f & FW_MASK_DMAC) != NegBit(n, FW_NEG_DMAC)) {
+    return false;
+  }
+  if (!(f & FW_WC_SMAC) &&
+      MacDiffers(p.sMac, r.sMac, r.sMacMask, f & FW_MASK_SMAC) != NegBit(n, FW_NEG_SMAC)) {
+    return false;
+  }
+  if (!(f & FW_WC_ETHTYPE) &&
+      static_cast<uint32_t>(p.ethType != FWLoad16(r.ethType)) != NegBit(n, FW_NEG_ETHTYPE)) {
+    return false;
+  }
+  if (!(f & FW_WC_VLAN) &&
+      static_cast<uint32_t>(p.vlan != FWLoad32(r.vlan1QTag)) != NegBit(n, FW_NEG_VLAN)) {
+    return false;
+  }
+
+  // 7. Addresses, by the packet's family; a rule wildcarding both matches
+  // either family whatever its bit 20.
+  if ((s->v4 || s->v6) && (f & (FW_WC_IPSA | FW_WC_IPDA)) != (FW_WC_IPSA | FW_WC_IPDA)) {
+    if (((f & FW_FLAG_IPV4) != 0) != s->v4) return false;
+    if (s->v4) {
+      if (!(f & FW_WC_IPSA) &&
+          V4AddrDiffers(p.sa, r.ipSa, r.ipSaHigh, f & FW_RANGE_IPSA) != NegBit(n, FW_NEG_IPSA)) {
+        return false;
+      }
+      if (!(f & FW_WC_IPDA) &&
+          V4AddrDiffers(p.da, r.ipDa, r.ipDaHigh, f & FW_RANGE_IPDA) != NegBit(n, FW_NEG_IPDA)) {
+        return false;
+      }
+    } else {
+      if (!(f & FW_WC_IPSA) &&
+          V6AddrDiffers(p.sa, r.ipSa, r.ipSaHigh, f & FW_RANGE_IPSA) != NegBit(n, FW_NEG_IPSA)) {
+        return false;
+      }
+      if (!(f & FW_WC_IPDA) &&
+          V6AddrDiffers(p.da, r.ipDa, r.ipDaHigh, f & FW_RANGE_IPDA) != NegBit(n, FW_NEG_IPDA)) {
+        return false;
+      }
+    }
+  }
+
+  // 8. Protocol.
+  if (!(f & FW_WC_IPPROTO) &&
+      static_cast<uint32_t>(p.ipProto != r.ipProto) != NegBit(n, FW_NEG_IPPROTO)) {
+    return false;
+  }
+
+  // 9. Resource-pool tag (no negation), read from the packet once per scan
+  // and only when a rule that compares it gets this far.
+  if (!(f & FW_WC_RPTAG)) {
+    if (!s->haveTag) {
+      (void)zel_PktResPoolTagGet(s->pkt, &s->tag);  // relied on to fill the tag
+      s->haveTag = true;
+    }
+    if (s->tag != r.rpTag) return false;
+  }
+
+  // 10. Without ports the rule matches here.
+  if (!s->ports) return true;
+
+  // 11-12. Ports (negation bits: 8 source, 7 destination).
+  if (!(f & FW_WC_SPORT) && PortDiffers(p.sPortRaw, p.sPort, r.sPort, r.sPortHigh,
+                                        f & FW_RANGE_SPORT) != NegBit(n, FW_NEG_SPORT)) {
+    return false;
+  }
+  if (!(f & FW_WC_DPORT) && PortDiffers(p.dPortRaw, p.dPort, r.dPort, r.dPortHigh,
+                                        f & FW_RANGE_DPORT) != NegBit(n, FW_NEG_DPORT)) {
+    return false;
+  }
+  return true;
+}
+
+// The packet's key words (fw_index.h), read from the summary with the
+// same loads as FWDecode. Direction 1 or 2 only.
+struct FWPacketKey {
+  uint64_t k0, k1, k2, k3;
+};
+
+inline uint64_t KeyAddress(const uint8_t* a, bool v4) {
+  return v4 ? FWLoad32(a) : FWFold32(FWLoad64(a), FWLoad64(a + 8));
+}
+
+inline FWPacketKey PacketKey(const FWScan& s) {
+  const FWPktSummary* summary = s.summary;
+  const uint32_t presence = s.presence;
+  FWPacketKey k;
+  k.k0 = (static_cast<uint64_t>(FWLoad16(summary->dPort)) << FW_KEY0_DPORT_SHIFT) |
+         (static_cast<uint64_t>(FWLoad16(summary->sPort)) << FW_KEY0_SPORT_SHIFT) |
+         (static_cast<uint64_t>(summary->ipProto) << FW_KEY0_PROTO_SHIFT) |
+         (static_cast<uint64_t>(presence & FW_WC_ALL) << FW_KEY0_PRESENCE_SHIFT) |
+         (s.v6 ? 0 : FW_KEY0_FAMILY_V4) | (s.v4 ? 0 : FW_KEY0_FAMILY_V6) |
+         (s.direction == SLCGenericDirectionFromSwitch ? FW_KEY0_DIR_FROM : FW_KEY0_DIR_TO);
+  k.k1 = 0;
+  if (s.v4 || s.v6) {
+    if (presence & FW_WC_IPSA) k.k1 = KeyAddress(summary->ipSa, s.v4);
+    if (presence & FW_WC_IPDA) k.k1 |= KeyAddress(summary->ipDa, s.v4) << 32;
+  }
+  k.k2 = static_cast<uint64_t>(FWLoad16(summary->ethType)) << FW_KEY_HIGH16_SHIFT;
+  if (presence & FW_WC_DMAC) k.k2 |= PacketMac(summary->dMac);
+  k.k3 = FWFold16(FWLoad32(summary->vlan1QTag)) << FW_KEY_HIGH16_SHIFT;
+  if (presence & FW_WC_SMAC) k.k3 |= PacketMac(summary->sMac);
+  return k;
 }
 
 }  // namespace
 
 FWRuleEntry* FWFindRuleForPacket(SLCGenericFilter* filter, ZelPkt* pkt, uint32_t direction,
-                                 const FWPktSummary* s) {
-  FWFilterContext* ctx = FWContext(filter);
-  ListLinks* head = &ctx->ruleList;
-  if (head->prev == head) return nullptr;
+                                 const FWPktSummary* summary) {
+  const FWScanIndex* index = FWContext(filter)->scanIndex;
+  if (index == nullptr || index->count == 0) return nullptr;
 
-  const uint32_t presence = s->presence;
-  const bool pktV4 = (presence & FW_PKT_IPV4) != 0;
-  const bool pktV6 = !pktV4 && (presence & FW_PKT_IPV6) != 0;
-  const bool pktPorts = (presence & FW_PKT_PORTS) != 0;
+  FWScan s;  // s.p is filled by FWDecode on first use
+  s.summary = summary;
+  s.presence = summary->presence;
+  s.direction = direction;
+  s.v4 = (s.presence & FW_PKT_IPV4) != 0;
+  s.v6 = !s.v4 && (s.presence & FW_PKT_IPV6) != 0;
+  s.ports = (s.presence & FW_PKT_PORTS) != 0;
+  s.decoded = false;
+  s.haveTag = false;
+  s.tag = 0;
+  s.pkt = pkt;
 
-  // Only fields whose presence bit is set are read from the summary.
-  FWPacketWords p{};
-  if (presence & FW_WC_DMAC) p.dMac = PacketMac(s->dMac);
-  if (presence & FW_WC_SMAC) p.sMac = PacketMac(s->sMac);
-  p.ethType = Load16(s->ethType);
-  p.vlan = Load32(s->vlan1QTag);
-  p.ipProto = s->ipProto;
-  if (pktV4 || pktV6) {
-    if (presence & FW_WC_IPSA) p.sa = PacketAddr(s->ipSa, pktV4);
-    if (presence & FW_WC_IPDA) p.da = PacketAddr(s->ipDa, pktV4);
+  const uint32_t count = index->count;
+  FWRuleEntry* const* entries = index->entries;
+
+  // The key words encode directions 1 and 2 only, and addresses only of
+  // IPv4 and IPv6 packets; any other packet gets the full test of every
+  // rule.
+  const bool keyed = (direction == SLCGenericDirectionFromSwitch ||
+                      direction == SLCGenericDirectionToSwitch) &&
+                     (s.v4 || s.v6 || (s.presence & (FW_WC_IPSA | FW_WC_IPDA)) == 0);
+  if (__builtin_expect(!keyed, 0)) {
+    for (uint32_t i = 0; i < count; i++) {
+      if (FWRuleMatches(entries[i]->rule, &s)) return entries[i];
+    }
+    return nullptr;
   }
-  p.sPortRaw = Load16(s->sPort);
-  p.dPortRaw = Load16(s->dPort);
-  p.sPort = FWNet16(s->sPort);
-  p.dPort = FWNet16(s->dPort);
 
-  uint16_t pktTag = 0;
-  bool haveTag = false;
-
-  for (ListLinks* l = head->prev; l != head; l = l->prev) {
-    FWRuleEntry* entry = FWEntryFromLink(l);
-    const FWRule& r = entry->rule;
-    const uint32_t f = r.ruleFlags;
-
-    // 1. Every field the rule does not wildcard must be present.
-    const uint32_t need = ~f & FW_WC_ALL;
-    if ((presence & need) != need) continue;
-    // 2. Direction (0 never equals a packet's 1 or 2).
-    if (r.direction != SLCGenericDirectionBidirectional && r.direction != direction) continue;
-
-    const uint32_t n = r.negateFlags;
-    // 3-6. L2 fields.
-    if (!(f & FW_WC_DMAC) &&
-        MacDiffers(p.dMac, r.dMac, r.dMacMask, f & FW_MASK_DMAC) != NegBit(n, FW_NEG_DMAC)) {
-      continue;
-    }
-    if (!(f & FW_WC_SMAC) &&
-        MacDiffers(p.sMac, r.sMac, r.sMacMask, f & FW_MASK_SMAC) != NegBit(n, FW_NEG_SMAC)) {
-      continue;
-    }
-    if (!(f & FW_WC_ETHTYPE) &&
-        static_cast<uint32_t>(p.ethType != Load16(r.ethType)) != NegBit(n, FW_NEG_ETHTYPE)) {
-      continue;
-    }
-    if (!(f & FW_WC_VLAN) &&
-        static_cast<uint32_t>(p.vlan != Load32(r.vlan1QTag)) != NegBit(n, FW_NEG_VLAN)) {
-      continue;
-    }
-
-    // 7. Addresses, by the packet's family; a rule wildcarding both
-    // matches either family whatever its bit 20.
-    if ((pktV4 || pktV6) && (f & (FW_WC_IPSA | FW_WC_IPDA)) != (FW_WC_IPSA | FW_WC_IPDA)) {
-      if (((f & FW_FLAG_IPV4) != 0) != pktV4) continue;
-      if (pktV4) {
-        if (!(f & FW_WC_IPSA) &&
-            V4AddrDiffers(p.sa, r.ipSa, r.ipSaHigh, f & FW_RANGE_IPSA) != NegBit(n, FW_NEG_IPSA)) {
-          continue;
-        }
-        if (!(f & FW_WC_IPDA) &&
-            V4AddrDiffers(p.da, r.ipDa, r.ipDaHigh, f & FW_RANGE_IPDA) != NegBit(n, FW_NEG_IPDA)) {
-          continue;
-        }
-      } else {
-        if (!(f & FW_WC_IPSA) &&
-            V6AddrDiffers(p.sa, r.ipSa, r.ipSaHigh, f & FW_RANGE_IPSA) != NegBit(n, FW_NEG_IPSA)) {
-          continue;
-        }
-        if (!(f & FW_WC_IPDA) &&
-            V6AddrDiffers(p.da, r.ipDa, r.ipDaHigh, f & FW_RANGE_IPDA) != NegBit(n, FW_NEG_IPDA)) {
-          continue;
-        }
-      }
-    }
-
-    // 8. Protocol.
-    if (!(f & FW_WC_IPPROTO) &&
-        static_cast<uint32_t>(p.ipProto != r.ipProto) != NegBit(n, FW_NEG_IPPROTO)) {
-      continue;
-    }
-
-    // 9. Resource-pool tag (no negation), read from the packet once per
-    // scan and only when a rule compares it.
-    if (!(f & FW_WC_RPTAG)) {
-      if (!haveTag) {
-        (void)zel_PktResPoolTagGet(pkt, &pktTag);  // relied on to fill the tag
-        haveTag = true;
-      }
-      if (pktTag != r.rpTag) continue;
-    }
-
-    // 10. Without ports the rule matches here.
-    if (!pktPorts) return entry;
-
-    // 11-12. Ports (negation bits: 8 source, 7 destination).
-    if (!(f & FW_WC_SPORT) && PortDiffers(p.sPortRaw, p.sPort, r.sPort, r.sPortHigh,
-                                          f & FW_RANGE_SPORT) != NegBit(n, FW_NEG_SPORT)) {
-      continue;
-    }
-    if (!(f & FW_WC_DPORT) && PortDiffers(p.dPortRaw, p.dPort, r.dPort, r.dPortHigh,
-                                          f & FW_RANGE_DPORT) != NegBit(n, FW_NEG_DPORT)) {
-      continue;
-    }
-    return entry;
+  const FWPacketKey k = PacketKey(s);
+  const FWScanSlot* const slots = index->slots;
+  auto miss = [&k](const FWScanSlot& slot) {
+    return ((k.k0 ^ slot.value[0]) & slot.mask[0]) | ((k.k1 ^ slot.value[1]) & slot.mask[1]) |
+           ((k.k2 ^ slot.value[2]) & slot.mask[2]) | ((k.k3 ^ slot.value[3]) & slot.mask[3]);
+  };
+  auto accept = [&](uint32_t i) {
+    return (slots[i].value[0] & FW_KEY0_EXACT) || FWRuleMatches(entries[i]->rule, &s);
+  };
+  // Two slots per iteration and one branch for both while neither passes;
+  // a passing pair is resolved in order, so the first match still wins.
+  uint32_t i = 0;
+  for (; i + 1 < count; i += 2) {
+    const uint64_t m0 = miss(slots[i]);
+    const uint64_t m1 = miss(slots[i + 1]);
+    if (__builtin_expect((m0 != 0) & (m1 != 0), 1)) continue;
+    if (m0 == 0 && accept(i)) return entries[i];
+    if (m1 == 0 && accept(i + 1)) return entries[i + 1];
   }
+  if (i < count && miss(slots[i]) == 0 && accept(i)) return entries[i];
   return nullptr;
 }

@@ -101,7 +101,8 @@ class UndoTest : public FirewallTest {
       EXPECT_EQ(host::Log::Count("Undoing ...", 2), 1u) << "allocation " << n;
       for (const char* m : {"Failed to copy hash entries", "Failed to allocate rule list entry",
                             "Failed to insert hash entry",
-                            "Failed to insert second half of bidirectional rule"}) {
+                            "Failed to insert second half of bidirectional rule",
+                            "Failed to allocate general rule index"}) {
         if (host::Log::Contains(m)) messages->insert(m);
       }
       if (HasFailure()) return 0;
@@ -135,12 +136,14 @@ TEST_F(UndoTest, ReplaceFailingAtAnyAllocationChangesNothing) {
   FwModel model = ModelOfBefore();
   std::set<std::string> messages;
   const uint64_t allocations = FailEveryAllocation(/*replace=*/true, &messages);
-  // Table and buckets, 7 new exact entries (two of them mirrors), 3 general.
-  EXPECT_EQ(allocations, 2u + 7u + 3u);
+  // Table and buckets, 7 new exact entries (two of them mirrors), 3 general,
+  // the scan index of the general rules.
+  EXPECT_EQ(allocations, 2u + 7u + 3u + 1u);
   EXPECT_EQ(messages, (std::set<std::string>{
                           "Failed to allocate firewall ruleset hash",
                           "Failed to allocate rule list entry", "Failed to insert hash entry",
-                          "Failed to insert second half of bidirectional rule"}));
+                          "Failed to insert second half of bidirectional rule",
+                          "Failed to allocate general rule index"}));
   model.Apply(rules::ParseRuleset(kNext), true);
   ExpectModel(model);
   EXPECT_EQ(ctx_->version, 8u);
@@ -158,12 +161,13 @@ TEST_F(UndoTest, AddFailingAtAnyAllocationChangesNothing) {
   std::set<std::string> messages;
   const uint64_t allocations = FailEveryAllocation(/*replace=*/false, &messages);
   // Table and buckets, a copy of every former exact entry, the new entries
-  // (the first record merges into its copy).
-  EXPECT_EQ(allocations, 2u + exactBefore + 6u + 3u);
+  // (the first record merges into its copy), the scan index.
+  EXPECT_EQ(allocations, 2u + exactBefore + 6u + 3u + 1u);
   EXPECT_EQ(messages, (std::set<std::string>{
                           "Failed to allocate firewall ruleset hash", "Failed to copy hash entries",
                           "Failed to allocate rule list entry", "Failed to insert hash entry",
-                          "Failed to insert second half of bidirectional rule"}));
+                          "Failed to insert second half of bidirectional rule",
+                          "Failed to allocate general rule index"}));
   model.Apply(rules::ParseRuleset(kNext), false);
   ExpectModel(model);
   // Copies now own the former sockets and tags.

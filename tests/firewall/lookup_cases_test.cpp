@@ -7,6 +7,7 @@
 #include <cstring>
 #include <string>
 
+#include "firewall/fw_ioctl.h"
 #include "tests/support/fw_fixture.h"
 #include "tools/lib/ruleset_builder.h"
 
@@ -166,6 +167,35 @@ TEST_F(LookupTest, EarliestGeneralRuleWinsAcrossAddedRulesets) {
   EXPECT_EQ(Action(Pkt("1.1.1.1", 1, "2.2.2.2", 81)), SLCGenericActionPunt);
   Load("action=copy dport=80\n" "action=drop dport=80\n");
   EXPECT_EQ(Action(p), SLCGenericActionCopy);
+}
+
+// A general rule removed through the ioctl channel no longer matches, and
+// the rules after it keep their order; a packet direction other than 1 or
+// 2 still meets only rules of its own direction or of both.
+TEST_F(LookupTest, RemovedGeneralRuleStopsMatchingAndOthersKeepOrder) {
+  Load("action=drop dport=80\n" "action=punt proto=6 sport=7\n" "action=copy dport=80\n"
+       "action=log dport=81 dir=7\n" "action=accept dport=81\n");
+  const ModelPacket p = Pkt("1.1.1.1", 7, "2.2.2.2", 80);
+  EXPECT_EQ(Action(p), SLCGenericActionDrop);
+  auto remove = [&](const char* line) {
+    std::vector<uint8_t> msg(8);
+    const uint32_t head[2] = {FWIoctlMsgClear, FWClearMethodRemove};
+    std::memcpy(msg.data(), head, sizeof(head));
+    const auto rs = rules::RulesetBuilder(8).Add(rules::ParseRule(line)).Bytes();
+    msg.insert(msg.end(), rs.begin(), rs.end());
+    FWFilterIoctlRequest(filter_, 7, msg.data(), msg.size());
+  };
+  remove("dport=80");
+  EXPECT_EQ(Action(p), SLCGenericActionPunt);
+  EXPECT_EQ(Action(Pkt("1.1.1.1", 1, "2.2.2.2", 80)), SLCGenericActionCopy);
+  const ModelPacket p81 = Pkt("1.1.1.1", 1, "2.2.2.2", 81);
+  EXPECT_EQ(Action(p81, 7), SLCGenericActionLog);
+  EXPECT_EQ(Action(p81, 2), SLCGenericActionAccept);
+  EXPECT_EQ(Action(p81, 0), SLCGenericActionAccept);
+  remove("proto=6 sport=7");
+  remove("dport=80");
+  EXPECT_EQ(Action(p), -1);
+  EXPECT_EQ(Action(p81, 2), SLCGenericActionAccept);
 }
 
 }  // namespace

@@ -1,0 +1,99 @@
+// The scan index of the general rules: a contiguous array, in ruleset order,
+// of one 64-byte slot per entry of ruleList, built whenever ruleList changes
+// (under configLock held exclusively) and read by the general scan (shared).
+//
+// A slot is a pre-filter. The scan packs the packet's fields once into four
+// key words K[0..3]; a rule can match only when, for every word,
+// (K[w] ^ value[w]) & mask[w] == 0. The slot encodes, as masked equality,
+// every test of the rule that can be expressed that way:
+//   - presence (every field the rule compares), direction, address family;
+//   - MACs (with their masks), ethertype, protocol, IPv4 addresses and
+//     ports compared for equality;
+//   - a necessary condition for the rest: the common leading bits of an
+//     IPv4 or port range, a 16-bit fold of the 802.1Q tag, 32-bit folds of
+//     IPv6 addresses.
+// Negated fields, IPv6 ranges and the resource-pool tag are left out (mask
+// 0). A slot that passes goes through the full step-by-step test of the
+// rule, unless its value word 0 carries FW_KEY0_EXACT: then every test of
+// the rule is exactly the masked equality and passing it is matching.
+//
+// Invariant (configLock): while the filter has general rules, scanIndex
+// lists exactly the entries of ruleList, back to front (ruleset order); with
+// none it is null or empty.
+#pragma once
+
+#include "firewall/fw_rules.h"
+
+struct FWScanSlot {
+  uint64_t value[4];  // rule side, already masked (plus FW_KEY0_EXACT)
+  uint64_t mask[4];
+};
+static_assert(sizeof(FWScanSlot) == 64, "one cache line per rule");
+
+struct FWScanIndex {
+  uint32_t count;          // slots in use, ruleset order
+  uint32_t capacity;
+  FWScanSlot* slots;       // inside this block, 64-byte aligned
+  FWRuleEntry** entries;   // inside this block; entries[i] belongs to slots[i]
+};
+
+// Key word 0: ports and protocol as stored, presence bits 0-9, the family
+// and direction bits, and two bits that only rules use.
+inline constexpr uint32_t FW_KEY0_DPORT_SHIFT = 0;   // 16 bits, as stored
+inline constexpr uint32_t FW_KEY0_SPORT_SHIFT = 16;  // 16 bits, as stored
+inline constexpr uint32_t FW_KEY0_PROTO_SHIFT = 32;  // 8 bits
+inline constexpr uint32_t FW_KEY0_PRESENCE_SHIFT = 40;  // presence bits 0-9
+inline constexpr uint64_t FW_KEY0_FAMILY_V4 = 1ull << 50;  // IPv4 packet, or not IP
+inline constexpr uint64_t FW_KEY0_FAMILY_V6 = 1ull << 51;  // IPv6 packet, or not IP
+inline constexpr uint64_t FW_KEY0_DIR_FROM = 1ull << 52;   // direction 1
+inline constexpr uint64_t FW_KEY0_DIR_TO = 1ull << 53;     // direction 2
+inline constexpr uint64_t FW_KEY0_NEVER = 1ull << 62;      // never set in a packet key
+inline constexpr uint64_t FW_KEY0_EXACT = 1ull << 63;      // value only, outside every mask
+// Key word 1: source address in bits 0-31, destination in 32-63; IPv4 as
+// stored, IPv6 folded (FWFold32).
+// Key word 2: dMac (zero-extended, as stored) in bits 0-47, ethertype as
+// stored in 48-63.
+// Key word 3: sMac in bits 0-47, the 802.1Q tag folded (FWFold16) in 48-63.
+inline constexpr uint32_t FW_KEY_HIGH16_SHIFT = 48;
+inline constexpr uint64_t FW_MAC48 = 0x0000ffffffffffffull;
+
+inline uint64_t FWLoad64(const uint8_t* p) {
+  uint64_t v;
+  __builtin_memcpy(&v, p, sizeof(v));
+  return v;
+}
+inline uint32_t FWLoad32(const uint8_t* p) {
+  uint32_t v;
+  __builtin_memcpy(&v, p, sizeof(v));
+  return v;
+}
+inline uint16_t FWLoad16(const uint8_t* p) {
+  uint16_t v;
+  __builtin_memcpy(&v, p, sizeof(v));
+  return v;
+}
+// A MAC or MAC mask of a rule record as a zero-extended word. Every such
+// field is followed by at least two more bytes of the record, so the 8-byte
+// load stays inside it.
+inline uint64_t FWRuleMac(const uint8_t* p) { return FWLoad64(p) & FW_MAC48; }
+static_assert(offsetof(FWRule, dMac) + 8 <= sizeof(FWRule));
+static_assert(offsetof(FWRule, sMac) + 8 <= sizeof(FWRule));
+static_assert(offsetof(FWRule, dMacMask) + 8 <= sizeof(FWRule));
+static_assert(offsetof(FWRule, sMacMask) + 8 <= sizeof(FWRule));
+
+// Equal inputs give equal folds, so comparing folds is a necessary
+// condition for equality.
+inline uint64_t FWFold16(uint32_t v) { return (v ^ (v >> 16)) & 0xffffu; }
+inline uint64_t FWFold32(uint64_t rawHi, uint64_t rawLo) {
+  const uint64_t x = rawHi ^ rawLo;
+  return (x ^ (x >> 32)) & 0xffffffffu;
+}
+
+// Builds the index of `ruleList` (entries linked at the front, so walked
+// from the back). An empty list yields null and ZEL_OK. ZEL_NO_MEMORY when
+// the block cannot be allocated; nothing is then allocated.
+[[nodiscard]] ZelStatus FWScanIndexBuild(const ListLinks* ruleList, FWScanIndex** index);
+void FWScanIndexFree(FWScanIndex** index);
+// Drops the slot of `entry`, if any, keeping the others in order; allocates
+// nothing. Called before the entry is unlinked and freed.
+void FWScanIndexForget(FWScanIndex* index, const FWRuleEntry* entry);
