@@ -18,15 +18,6 @@
 #include "tests/control/control_test_util.h"
 #include "tools/lib/frames.h"
 
-#if defined(__SANITIZE_THREAD__)
-// Rule counters are plain 64-bit adds made under the shared hold of
-// configLock (a lost increment is accepted), so exporting a ruleset, which
-// copies the counters under the same shared hold, formally races with the
-// packet walk that adds to them. Only reports whose access sits directly in
-// the walk's own body (where the adds are) are silenced; the lookup, the
-// apply and clear steps and every control channel stay checked.
-extern "C" const char* __tsan_default_suppressions() { return "race_top:FWWalkList\n"; }
-#endif
 
 namespace {
 

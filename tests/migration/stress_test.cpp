@@ -20,15 +20,6 @@
 #include "tests/support/migration_support.h"
 #include "tools/lib/frames.h"
 
-// The firewall counts packets with plain adds under the shared hold of
-// configLock, accepting that concurrent walks of one filter may lose an
-// increment (and that a save may read a counter mid-update). Those are the
-// only races this test is allowed to see; the increment is the top frame of
-// every such report. The longer history keeps that frame restorable, so the
-// suppression matches the counter update and nothing else.
-extern "C" const char* __tsan_default_suppressions() { return "race_top:FWWalkList\n"; }
-extern "C" const char* __tsan_default_options() { return "history_size=7"; }
-
 namespace {
 
 using namespace migsupport;
