@@ -13,42 +13,36 @@ using testsupport::ModuleTest;
 
 using Filters = ModuleTest;
 
+struct ConfigCase {
+  host::FilterConfig config;
+  const char* vmUUID;
+  uint32_t vnicIndex;
+};
+
 TEST_F(Filters, ReadsItsConfiguration) {
-  host::FilterConfig config;
-  config.name = "vnic7";
-  config.failurePolicy = 1;
-  config.vmUUID = "4229a8e0-uuid";
-  config.vnicIndex = 3;
-  host::FilterId id = CreateFilter(kDefaultAgent, config);
-  SLCGenericFilter* f = Filter(id);
-  EXPECT_STREQ(f->name, "vnic7");
-  EXPECT_EQ(f->failurePolicy, 1u);
-  EXPECT_EQ(f->endPointType, 0u);
-  EXPECT_STREQ(f->vmUUID, "4229a8e0-uuid");
-  EXPECT_EQ(f->vnicIndex, 3u);
-  EXPECT_EQ(f->refCount, 1u);
-  EXPECT_EQ(f->spAttachState, SLCGenericSpDetached);
-  EXPECT_EQ(f->migrationState, SLCGenericStateIdle);
-  EXPECT_EQ(f->fastPath, Agent());
-}
-
-TEST_F(Filters, OtherEndpointsHaveNoVmOrVnic) {
-  host::FilterConfig config;
-  config.endPointType = 2;
-  config.vmUUID = "ignored";
-  config.vnicIndex = 5;
-  SLCGenericFilter* f = Filter(CreateFilter(kDefaultAgent, config));
-  EXPECT_STREQ(f->vmUUID, "");
-  EXPECT_EQ(f->vnicIndex, 0xFFFFFFFFu);
-}
-
-TEST_F(Filters, UnsetUuidIsNotAnError) {
-  host::FilterConfig config;
-  config.vmUUIDUnset = true;
-  config.vnicIndex = 9;
-  SLCGenericFilter* f = Filter(CreateFilter(kDefaultAgent, config));
-  EXPECT_STREQ(f->vmUUID, "");
-  EXPECT_EQ(f->vnicIndex, 9u);
+  host::FilterConfig vm;
+  vm.name = "vnic7";
+  vm.failurePolicy = 1;
+  vm.vmUUID = "4229a8e0-uuid";
+  vm.vnicIndex = 3;
+  host::FilterConfig otherEndpoint = vm;  // no VM and no vNIC to ask about
+  otherEndpoint.endPointType = 2;
+  host::FilterConfig unsetUuid = vm;      // the UUID query's "not set" is no error
+  unsetUuid.vmUUIDUnset = true;
+  unsetUuid.vmUUID.clear();
+  for (const ConfigCase& c : {ConfigCase{vm, "4229a8e0-uuid", 3},
+                              ConfigCase{otherEndpoint, "", 0xFFFFFFFFu},
+                              ConfigCase{unsetUuid, "", 3}}) {
+    SLCGenericFilter* f = Filter(CreateFilter(kDefaultAgent, c.config));
+    EXPECT_STREQ(f->name, "vnic7");
+    EXPECT_EQ(f->failurePolicy, 1u);
+    EXPECT_EQ(f->endPointType, c.config.endPointType);
+    EXPECT_STREQ(f->vmUUID, c.vmUUID);
+    EXPECT_EQ(f->vnicIndex, c.vnicIndex);
+    EXPECT_EQ(f->refCount, 1u);
+    EXPECT_EQ(f->spAttachState, SLCGenericSpDetached);
+    EXPECT_EQ(f->migrationState, SLCGenericStateIdle);
+  }
 }
 
 struct ConfigFailure {

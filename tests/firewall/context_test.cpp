@@ -48,19 +48,6 @@ INSTANTIATE_TEST_SUITE_P(
         ConfigCase{"x default-action=ACTION_DROP", SLCGenericActionAccept, nullptr},
         ConfigCase{"default-action", SLCGenericActionAccept, nullptr}));
 
-TEST_F(ModuleTest, FreshContext) {
-  FWFilterContext* ctx = Ctx(CreateFilter());
-  EXPECT_EQ(ctx->ruleHash, nullptr);
-  EXPECT_TRUE(List_IsEmpty(&ctx->ruleList));
-  EXPECT_EQ(ctx->version, 8u);
-  EXPECT_EQ(ctx->numRules, 0u);
-  EXPECT_EQ(ctx->fwFeatures, 0u);
-  EXPECT_EQ(ctx->fragOverride, 0u);
-  EXPECT_EQ(ctx->ioctl, 0u);
-  EXPECT_EQ(ctx->spAttachState, SLCGenericSpDetached);
-  EXPECT_EQ(ctx->filter->agentPriv, ctx);
-}
-
 TEST_F(ModuleTest, AttachStateIsCopiedUnderTheConfigLock) {
   host::FilterId id = CreateFilter();
   host::Sluice::SetPolicy(host::RequestKind::SetSlowPath, testsupport::Replies(host::ReplyMode::Deferred));
