@@ -1,10 +1,12 @@
 // Helpers for the packet-path and action tests: one firewall filter, rules
-// from text, frames from the frame builder, and lists run through the
-// framework's process-packets callback.
+// from text, frames from the frame builder, lists run through the filter.
 #pragma once
 
+#include <algorithm>
+#include <memory>
 #include <string>
 #include <string_view>
+#include <utility>
 #include <vector>
 
 #include "firewall/fw_packet.h"
@@ -15,119 +17,104 @@
 namespace fwpathtest {
 
 using frames::Bytes;
+using Frames = std::vector<Bytes>;
 using frames::FrameBuilder;
+using testsupport::Replies;
 
-inline const frames::MacAddr kDstMac = frames::Mac("02:00:00:00:00:02");
-inline const frames::MacAddr kSrcMac = frames::Mac("02:00:00:00:00:01");
-
-// The L2 part of an exact rule that matches frames built from Base().
-inline constexpr char kExactL2[] =
-    "dmac=02:00:00:00:00:02 smac=02:00:00:00:00:01 vlan=none ";
-
-inline FrameBuilder Base() { return FrameBuilder().Eth(kDstMac, kSrcMac); }
-
+inline FrameBuilder Base() {
+  return FrameBuilder().Eth(frames::Mac("02:00:00:00:00:02"), frames::Mac("02:00:00:00:00:01"));
+}
+inline FrameBuilder V4() { return Base().Ipv4(frames::Ip4("10.0.0.1"), frames::Ip4("10.0.0.2")); }
 inline Bytes Tcp4(uint16_t sport = 1234, uint16_t dport = 80, size_t payload = 20) {
-  return Base()
-      .Ipv4(frames::Ip4("10.0.0.1"), frames::Ip4("10.0.0.2"))
-      .Tcp(sport, dport)
-      .Payload(payload)
-      .Build();
+  return V4().Tcp(sport, dport).Payload(payload).Build();
 }
 
-inline Bytes Udp4(uint16_t sport, uint16_t dport, size_t payload = 20) {
-  return Base()
-      .Ipv4(frames::Ip4("10.0.0.1"), frames::Ip4("10.0.0.2"))
-      .Udp(sport, dport)
-      .Payload(payload)
-      .Build();
-}
-
-// An exact IPv4 TCP rule for Tcp4(sport, dport).
+// An exact IPv4 TCP rule matching Tcp4(sport, dport).
 inline std::string ExactTcp4(std::string_view action, uint16_t sport = 1234, uint16_t dport = 80,
                              std::string_view extra = "") {
-  return std::string("action=") + std::string(action) + " " + kExactL2 +
-         "ethtype=0x0800 sa=10.0.0.1 da=10.0.0.2 proto=tcp sport=" + std::to_string(sport) +
+  return "action=" + std::string(action) +
+         " dmac=02:00:00:00:00:02 smac=02:00:00:00:00:01 vlan=none ethtype=0x0800 sa=10.0.0.1"
+         " da=10.0.0.2 proto=tcp sport=" + std::to_string(sport) +
          " dport=" + std::to_string(dport) + " " + std::string(extra);
+}
+
+// The frame after an L2 rewrite to kRewriteMac: destination replaced and,
+// when turned around, the old destination as the source.
+inline constexpr char kRewriteMac[] = "0a:0b:0c:0d:0e:0f";
+inline Bytes Rewritten(Bytes f, bool turnedAround) {
+  const frames::MacAddr mac = frames::Mac(kRewriteMac);
+  if (turnedAround) std::copy(f.begin(), f.begin() + 6, f.begin() + 6);
+  std::copy(mac.begin(), mac.end(), f.begin());
+  return f;
+}
+
+// A packet to make: scatter-gather element sizes (empty: one element) and the
+// mapped length. A read-only packet aborts the host when written, so cases
+// with one prove the original was left alone.
+inline host::PacketSpec Pkt(const Bytes& frame, bool writable = true,
+                            std::vector<uint32_t> sg = {}, uint32_t mapped = UINT32_MAX) {
+  return {.frame = frame, .sgSizes = std::move(sg), .mappedLen = mapped, .writable = writable};
 }
 
 class PacketPathTest : public testsupport::FirewallTest {
  protected:
-  // Applies ruleset text (rules, optional header line), replacing.
   void ApplyText(std::string_view text) {
     ASSERT_EQ(Apply(rules::ParseRuleset(text)), ZEL_OK) << text;
   }
-
-  // Runs the packets through the filter as one list; returns the frames
-  // still in the list afterwards (their packets are released).
-  std::vector<Bytes> Run(const std::vector<ZelPkt*>& pkts, uint32_t direction,
-                         ZelStatus* status = nullptr) {
-    host::PacketList list;
-    for (ZelPkt* p : pkts) list.Append(p);
-    ZelStatus st = host::Sluice::Deliver(id_, list, direction);
-    if (status != nullptr) *status = st;
-    std::vector<Bytes> passed;
-    for (ZelPkt* p : list.Packets()) passed.push_back(host::Packets::Frame(p));
+  // Runs the packets through the filter as one list and returns those left
+  // in it (alive until the next run).
+  std::vector<ZelPkt*> Run(const std::vector<host::PacketSpec>& pkts, uint32_t direction) {
+    list_ = std::make_unique<host::PacketList>();
+    for (const host::PacketSpec& p : pkts) list_->Append(host::Packets::Make(p));
+    EXPECT_EQ(host::Sluice::Deliver(id_, *list_, direction), ZEL_OK);
+    return list_->Packets();
+  }
+  Frames RunFrames(const Frames& frames, uint32_t direction) {
+    Frames passed;
+    EXPECT_EQ(Deliver(id_, frames, direction, &passed), ZEL_OK);
     return passed;
   }
-  std::vector<Bytes> RunFrames(const std::vector<Bytes>& frames, uint32_t direction) {
-    std::vector<ZelPkt*> pkts;
-    for (const Bytes& f : frames) pkts.push_back(host::Packets::Make(f));
-    return Run(pkts, direction);
+  static Frames FramesOf(const std::vector<ZelPkt*>& pkts) {
+    Frames out;
+    for (ZelPkt* p : pkts) out.push_back(host::Packets::Frame(p));
+    return out;
   }
 
-  // Registers a slow path whose attach request is answered later: the
-  // filter stays attaching until FinishAttach().
-  void StartAttaching() {
-    host::RequestPolicy deferred;
-    deferred.mode = host::ReplyMode::Deferred;
-    host::Sluice::SetPolicy(host::RequestKind::SetSlowPath, deferred);
+  // Registers a slow path; its attach reply is held back unless `finish`.
+  void Attach(bool finish = true) {
+    host::Sluice::SetPolicy(host::RequestKind::SetSlowPath, Replies(host::ReplyMode::Deferred));
     ASSERT_EQ(host::Sluice::RegisterSlowPath(testsupport::kDefaultAgent, 1), ZEL_OK);
     host::Timers::RunDue();
     ASSERT_EQ(ctx_->spAttachState, SLCGenericSpAttaching);
+    if (finish) FinishAttach();
   }
   void FinishAttach() {
     host::Sluice::ReleaseReplies(host::RequestKind::SetSlowPath);
     ASSERT_EQ(ctx_->spAttachState, SLCGenericSpAttached);
   }
-  void Attach() {
-    StartAttaching();
-    FinishAttach();
-  }
   void TearDown() override {
-    host::Sluice::ReleaseReplies(host::RequestKind::SetSlowPath);
+    list_.reset();
     FirewallTest::TearDown();
   }
 
-  // Frames of every list handed to the framework, with the direction of
-  // each list; the packets are released.
-  struct Handed {
-    uint32_t direction;
-    std::vector<Bytes> frames;
-    bool operator==(const Handed&) const = default;
-  };
-  static std::vector<Handed> Frames(std::vector<host::Delivery> deliveries) {
+  // Lists handed to the framework: direction and frames (packets released).
+  using Handed = std::pair<uint32_t, Frames>;
+  static std::vector<Handed> Take(std::vector<host::Delivery> deliveries) {
     std::vector<Handed> out;
-    for (const host::Delivery& d : deliveries) {
-      Handed h{d.direction, {}};
-      for (ZelPkt* p : d.packets) h.frames.push_back(host::Packets::Frame(p));
-      out.push_back(h);
-    }
+    for (const host::Delivery& d : deliveries) out.emplace_back(d.direction, FramesOf(d.packets));
     testsupport::ReleaseDeliveries(&deliveries);
     return out;
   }
-  std::vector<Handed> Faulted() { return Frames(host::Sluice::TakeFaulted(id_)); }
-  std::vector<Handed> Issued() { return Frames(host::Sluice::TakeIssued(id_)); }
+  std::vector<Handed> Faulted() { return Take(host::Sluice::TakeFaulted(id_)); }
+  std::vector<Handed> Issued() { return Take(host::Sluice::TakeIssued(id_)); }
 
-  // Counters by value (the record is packed: no references into it).
-  static uint64_t Pkts(const FWRuleEntry* e) { return e->rule.pktCount; }
-  static uint64_t Octets(const FWRuleEntry* e) { return e->rule.byteCount; }
-
-  // The installed rule entries, exact ones first.
-  FWRuleEntry* Exact(std::string_view line) { return FindExact(rules::ParseRule(line)); }
-  FWRuleEntry* General(size_t index) {
-    std::vector<FWRuleEntry*> g = GeneralEntries();
-    return index < g.size() ? g[index] : nullptr;
+  uint64_t ExactPkts(std::string_view line) {
+    const FWRuleEntry* e = FindExact(rules::ParseRule(line));
+    return e != nullptr ? +e->rule.pktCount : ~0ull;
   }
+  uint64_t GeneralPkts(size_t i) { return +GeneralEntries().at(i)->rule.pktCount; }
+
+  std::unique_ptr<host::PacketList> list_;
 };
 
 }  // namespace fwpathtest
