@@ -289,10 +289,10 @@ void BM_NoRulesetAccept(benchmark::State& state) {
 BENCHMARK(BM_NoRulesetAccept);
 
 // --fixed=<scenario>:<size>:<lists>: a fixed amount of work for callgrind.
-bool RunFixed(const char* spec) {
+bool RunFixed(const char* scenario) {
   char name[16] = {};
   unsigned size = 0, lists = 0;
-  if (std::sscanf(spec, "%15[a-z0-9]:%u:%u", name, &size, &lists) != 3) return false;
+  if (std::sscanf(scenario, "%15[a-z0-9]:%u:%u", name, &size, &lists) != 3) return false;
   Shape shape;
   if (std::strcmp(name, "exact") == 0) shape = Shape::Exact;
   else if (std::strcmp(name, "general") == 0) shape = Shape::General;
@@ -301,7 +301,7 @@ bool RunFixed(const char* spec) {
   else return false;
   Scenario& s = Use(shape, size);
   for (unsigned i = 0; i < lists; i++) s.RunOne();
-  std::printf("%s: %u lists of %zu packets processed\n", spec, lists, kListLen);
+  std::printf("%s: %u lists of %zu packets processed\n", scenario, lists, kListLen);
   current.reset();
   return true;
 }

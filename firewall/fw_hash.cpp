@@ -21,18 +21,6 @@
 
 namespace {
 
-// Unaligned fixed-size loads; the compiler turns these into single moves.
-inline uint64_t Load64(const uint8_t* p) {
-  uint64_t v;
-  __builtin_memcpy(&v, p, sizeof(v));
-  return v;
-}
-inline uint32_t Load32(const uint8_t* p) {
-  uint32_t v;
-  __builtin_memcpy(&v, p, sizeof(v));
-  return v;
-}
-
 constexpr uint32_t kRuleL2 = offsetof(FWRule, dMac);          // record run: dMac .. ipSa
 static_assert(offsetof(FWRule, sMac) - kRuleL2 == FW_TUPLE_SMAC);
 static_assert(offsetof(FWRule, ethType) - kRuleL2 == FW_TUPLE_ETHTYPE);
@@ -82,20 +70,20 @@ int FWRuleCompare(const FWRuleEntry* entry, const FWRuleTuple* tuple) {
   uint64_t diff;
   if (ruleV4) {
     // Tuple 0-21 against record 8-29: words at 0, 8 and (overlapping) 14.
-    diff = (Load64(r) ^ Load64(t)) | (Load64(r + 8) ^ Load64(t + 8)) |
-           (Load64(r + 14) ^ Load64(t + 14));
+    diff = (FWLoad64(r) ^ FWLoad64(t)) | (FWLoad64(r + 8) ^ FWLoad64(t + 8)) |
+           (FWLoad64(r + 14) ^ FWLoad64(t + 14));
     // ipDa, then protocol and ports (record 58-62 against tuple 26-30, as
     // two overlapping 4-byte words).
     const uint8_t* rp = RuleBytes(&entry->rule) + offsetof(FWRule, ipProto);
-    diff |= Load32(entry->rule.ipDa) ^ Load32(t + FW_TUPLE_V4_IPDA);
-    diff |= (Load32(rp) ^ Load32(t + FW_TUPLE_V4_PROTO)) |
-            (Load32(rp + 1) ^ Load32(t + FW_TUPLE_V4_PROTO + 1));
+    diff |= FWLoad32(entry->rule.ipDa) ^ FWLoad32(t + FW_TUPLE_V4_IPDA);
+    diff |= (FWLoad32(rp) ^ FWLoad32(t + FW_TUPLE_V4_PROTO)) |
+            (FWLoad32(rp + 1) ^ FWLoad32(t + FW_TUPLE_V4_PROTO + 1));
   } else {
     // Tuple 0-54 against record 8-62: words at 0..40 and (overlapping) 47.
-    diff = (Load64(r) ^ Load64(t)) | (Load64(r + 8) ^ Load64(t + 8)) |
-           (Load64(r + 16) ^ Load64(t + 16)) | (Load64(r + 24) ^ Load64(t + 24)) |
-           (Load64(r + 32) ^ Load64(t + 32)) | (Load64(r + 40) ^ Load64(t + 40)) |
-           (Load64(r + 47) ^ Load64(t + 47));
+    diff = (FWLoad64(r) ^ FWLoad64(t)) | (FWLoad64(r + 8) ^ FWLoad64(t + 8)) |
+           (FWLoad64(r + 16) ^ FWLoad64(t + 16)) | (FWLoad64(r + 24) ^ FWLoad64(t + 24)) |
+           (FWLoad64(r + 32) ^ FWLoad64(t + 32)) | (FWLoad64(r + 40) ^ FWLoad64(t + 40)) |
+           (FWLoad64(r + 47) ^ FWLoad64(t + 47));
   }
   return diff != 0 ? 1 : 0;
 }

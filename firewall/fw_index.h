@@ -57,21 +57,6 @@ inline constexpr uint64_t FW_KEY0_EXACT = 1ull << 63;      // value only, outsid
 inline constexpr uint32_t FW_KEY_HIGH16_SHIFT = 48;
 inline constexpr uint64_t FW_MAC48 = 0x0000ffffffffffffull;
 
-inline uint64_t FWLoad64(const uint8_t* p) {
-  uint64_t v;
-  __builtin_memcpy(&v, p, sizeof(v));
-  return v;
-}
-inline uint32_t FWLoad32(const uint8_t* p) {
-  uint32_t v;
-  __builtin_memcpy(&v, p, sizeof(v));
-  return v;
-}
-inline uint16_t FWLoad16(const uint8_t* p) {
-  uint16_t v;
-  __builtin_memcpy(&v, p, sizeof(v));
-  return v;
-}
 // A MAC or MAC mask of a rule record as a zero-extended word. Every such
 // field is followed by at least two more bytes of the record, so the 8-byte
 // load stays inside it.

@@ -5,6 +5,24 @@
 
 #include "firewall/firewall.h"
 
+// Unaligned fixed-size loads of record and frame bytes; the compiler turns
+// each into a single move.
+inline uint64_t FWLoad64(const uint8_t* p) {
+  uint64_t v;
+  __builtin_memcpy(&v, p, sizeof(v));
+  return v;
+}
+inline uint32_t FWLoad32(const uint8_t* p) {
+  uint32_t v;
+  __builtin_memcpy(&v, p, sizeof(v));
+  return v;
+}
+inline uint16_t FWLoad16(const uint8_t* p) {
+  uint16_t v;
+  __builtin_memcpy(&v, p, sizeof(v));
+  return v;
+}
+
 // Fills `tuple` from `rule` (family from ruleFlags bit 20) without hashing.
 // For an IPv4 rule bytes 31-54 of the tuple are left as they were.
 void FWFillTupleFromRule(const FWRule* rule, FWRuleTuple* tuple);

@@ -76,10 +76,10 @@ FWRuleEntry* FirewallTest::FindExact(const FWRule& rule) {
 ZelPkt* FirewallTest::PacketWithTag(uint16_t tag) {
   auto it = tagPackets_.find(tag);
   if (it != tagPackets_.end()) return it->second;
-  host::PacketSpec spec;
-  spec.frame.assign(64, 0);
-  spec.resPoolTag = tag;
-  ZelPkt* pkt = host::Packets::Make(spec);
+  host::PacketSpec layout;
+  layout.frame.assign(64, 0);
+  layout.resPoolTag = tag;
+  ZelPkt* pkt = host::Packets::Make(layout);
   tagPackets_[tag] = pkt;
   return pkt;
 }
