@@ -245,7 +245,7 @@ ZelStatus zel_SluiceUnregisterFastPath(ZelSluiceFastPathHandle handle) {
   // its slow path, which must still be registered then.
   for (auto& [f, priv] : filters) {
     RetryUntilOk(
-        [&, priv = priv] {
+        [&, f = f, priv = priv] {
           ZelStatus s = ops->destroyFilter != nullptr ? ops->destroyFilter(priv) : ZEL_OK;
           if (s == ZEL_OK) {
             std::lock_guard<std::mutex> g(S().mu);

@@ -165,7 +165,10 @@ TEST_F(SaveRestoreTest, RepliesInTheWrongStateOnlyReleaseTheirReference) {
   // test holds the reference the framework would for its own call.
   AttachSlowPath(kSlowPathId);
   SLCGenericPrefetchSavedState(f_);
-  SLCGenericSpinGuard(f_->lock), f_->refCount++;  // under the lock until the ';'
+  {
+    SLCGenericSpinGuard hold(f_->lock);
+    f_->refCount++;
+  }
   SLCGenericRetrieveSlowPathReply(f_, nullptr, Pattern(8).data(), uint64_t{1} << 32, ZEL_OK);
   EXPECT_EQ(host::Log::Count("Failed to alloc 4294967296 bytes for state buffer", 1), 1u);
   ASSERT_EQ(host::Sluice::ReleaseReplies(RetrieveState), 1u);
