@@ -8,7 +8,9 @@
 //
 // Packet lists and iterators are host objects whose size is known only at
 // run time; callers place them in storage of zel_PktListSizeInBytes() and
-// zel_PktListIterSizeOf() bytes (aligned to 16).
+// zel_PktListIterSizeOf() bytes (aligned to 16). Several iterators may walk
+// one list: removing or replacing the packet under one iterator leaves the
+// others valid as long as none of them stands on that packet.
 #pragma once
 
 #include "platform/zel_status.h"
