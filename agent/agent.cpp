@@ -58,6 +58,23 @@ void CopyText(char* dst, size_t size, const char* src) {
   dst[n] = '\0';
 }
 
+// Destroys the agent's lock once nobody can use it: waits out anyone still
+// inside it and cancels an attach pass still pending (a slow path may have
+// registered as soon as the framework knew the agent), which would otherwise
+// run on a freed agent.
+void DestroyAgentLock(SLCGenericFastPath* fp) {
+  ZelTimerHandle timer;
+  {
+    SLCGenericSpinGuard guard(fp->lock);
+    timer = fp->attachTimer;
+  }
+  if (timer != 0) {
+    zel_TimerCancel(slcGenericTimerQueue, timer, true);
+  }
+  zel_SpinlockDestroy(fp->lock);
+  fp->lock = nullptr;
+}
+
 }  // namespace
 
 ZelStatus SLCGenericInitFastPathAgent(char* createText) {
@@ -120,7 +137,7 @@ ZelStatus SLCGenericInitFastPathAgent(char* createText) {
       SLCG_LOG_OBJ(SLCG_ATTENTION, agent->name, "Failed to unregister agent");
     }
     fp->fastPathHandle = nullptr;
-    zel_SpinlockDestroy(fp->lock);
+    DestroyAgentLock(fp);
     SLCGenericMagicKill(fp);
     SLCGenericFree(agent);
     return status;
@@ -207,18 +224,7 @@ void SLCGenericCleanupFastPathAgent(SLCGenericAgent* agent) {
   }
 
   if (fp->lock != nullptr) {
-    ZelTimerHandle timer;
-    {
-      // Waits out anyone still inside the lock.
-      SLCGenericSpinGuard guard(fp->lock);
-      timer = fp->attachTimer;
-    }
-    // An attach pass still pending would find a freed agent.
-    if (timer != 0) {
-      zel_TimerCancel(slcGenericTimerQueue, timer, true);
-    }
-    zel_SpinlockDestroy(fp->lock);
-    fp->lock = nullptr;
+    DestroyAgentLock(fp);
   }
 
   SLCGenericFWCleanupCharDev(fp);
