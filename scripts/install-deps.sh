@@ -14,6 +14,11 @@ have_pkg libgtest-dev || need+=(libgtest-dev)
 have_pkg libgmock-dev || need+=(libgmock-dev)
 have_pkg libbenchmark-dev || need+=(libbenchmark-dev)
 have_cmd valgrind || need+=(valgrind)
+have_cmd pkg-config || need+=(pkg-config)
+have_pkg libpcap-dev || need+=(libpcap-dev)
+have_pkg libfmt-dev || need+=(libfmt-dev)
+have_pkg nlohmann-json3-dev || need+=(nlohmann-json3-dev)
+have_pkg libcli11-dev || need+=(libcli11-dev)
 
 if [ ${#need[@]} -eq 0 ]; then
   exit 0

@@ -21,6 +21,7 @@
 #include "host/net/packets.h"
 #include "host/sluice/framework.h"
 #include "module/module.h"
+#include "tools/lib/capture.h"
 #include "tools/lib/frames.h"
 #include "tools/lib/ruleset_builder.h"
 
@@ -115,7 +116,7 @@ std::vector<frames::CaptureRecord> DefaultFrames() {
   const auto vm = Mac("02:00:00:00:00:10");
   const auto gw = Mac("02:00:00:00:00:01");
   std::vector<frames::CaptureRecord> out;
-  auto add = [&](uint32_t dir, const frames::Bytes& f) { out.push_back({dir, f, 0}); };
+  auto add = [&](uint32_t dir, const frames::Bytes& f) { out.push_back({dir, f}); };
   add(1, FrameBuilder().Eth(vm, gw).Ipv4(Ip4("10.0.0.1"), Ip4("10.0.0.10")).Tcp(40000, 80,
                                                                                 frames::kTcpSyn)
              .Build());
@@ -224,11 +225,12 @@ int main(int argc, char** argv) {
   if (o.capturePath.empty()) {
     records = DefaultFrames();
   } else {
-    std::string error;
-    if (!frames::ReadCapture(o.capturePath, &records, &error)) {
-      std::fprintf(stderr, "sluice-run: %s: %s\n", o.capturePath.c_str(), error.c_str());
+    frames::CaptureRead read = frames::ReadCapture(o.capturePath);
+    if (!read.ok()) {
+      std::fprintf(stderr, "sluice-run: %s: %s\n", o.capturePath.c_str(), read.error.c_str());
       return 1;
     }
+    records = std::move(read.records);
   }
   if (!o.saveCapturePath.empty()) {
     std::string error;
