@@ -28,18 +28,6 @@
 
 namespace frames {
 
-inline constexpr uint32_t kDirectionUnknown = 0;
-inline constexpr uint32_t kDirectionFromSwitch = 1;
-inline constexpr uint32_t kDirectionToSwitch = 2;
-
-struct CaptureRecord {
-  uint32_t direction = kDirectionUnknown;
-  Bytes frame;              // the bytes captured
-  uint32_t origLen = 0;     // length on the wire; 0 = frame.size()
-  int64_t tsSec = 0;        // timestamp, seconds since the epoch
-  uint32_t tsNsec = 0;      // and nanoseconds
-};
-
 // Link types a writer can produce.
 enum class LinkType { Ethernet, RawIpv4 };
 

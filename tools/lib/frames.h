@@ -212,6 +212,19 @@ class FrameBuilder {
   size_t padTo_ = 0;
 };
 
+// One captured frame (tools/lib/capture.h reads and writes them).
+inline constexpr uint32_t kDirectionUnknown = 0;
+inline constexpr uint32_t kDirectionFromSwitch = 1;
+inline constexpr uint32_t kDirectionToSwitch = 2;
+
+struct CaptureRecord {
+  uint32_t direction = kDirectionUnknown;
+  Bytes frame;              // the bytes captured
+  uint32_t origLen = 0;     // length on the wire; 0 = frame.size()
+  int64_t tsSec = 0;        // timestamp, seconds since the epoch
+  uint32_t tsNsec = 0;      // and nanoseconds
+};
+
 // "00 11 22 ..." for test messages.
 std::string Hex(std::span<const uint8_t> bytes);
 
