@@ -78,10 +78,10 @@ TEST_F(Trace, EachDecisionIsReportedWithItsRuleAndPosition) {
     EXPECT_EQ(t.fragOverride, +SLCGenericActionDrop);
     if (c.decision == FWTraceExactRule || c.decision == FWTraceGeneralRule) {
       EXPECT_EQ(t.exactHit, c.decision == FWTraceExactRule);
-      EXPECT_EQ(t.rule.action, c.action);
+      EXPECT_EQ(+t.rule.action, c.action);
       // The position names the same record the serialised ruleset holds there.
       const FWRule at = PopulatedAt(t.position);
-      EXPECT_EQ(at.action, t.rule.action);
+      EXPECT_EQ(+at.action, +t.rule.action);
       EXPECT_EQ(0, std::memcmp(at.dPort, t.rule.dPort, 2));
       if (c.generalIndex >= 0) {
         EXPECT_EQ(t.generalIndex, static_cast<uint32_t>(c.generalIndex));
@@ -123,7 +123,7 @@ TEST_F(Trace, NamesTheRuleTheWalkCountsAndCountsNothing) {
       EXPECT_EQ(now.pktCount - was.pktCount, decided ? 1u : 0u) << "rule " << i;
       EXPECT_EQ(now.byteCount - was.byteCount, decided ? f.size() : 0u) << "rule " << i;
       if (decided) {
-        EXPECT_EQ(t.rule.pktCount, was.pktCount);
+        EXPECT_EQ(+t.rule.pktCount, +was.pktCount);
       }
     }
   }

@@ -4,6 +4,7 @@
 // and output captures that tcpdump and tshark read (when installed).
 #include <gtest/gtest.h>
 #include <sys/wait.h>
+#include <unistd.h>
 
 #include <cstdlib>
 #include <filesystem>
@@ -27,7 +28,10 @@ std::string Slurp(const std::string& path) {
   return ss.str();
 }
 
-std::string Temp(const std::string& name) { return ::testing::TempDir() + "/sluice_cli_" + name; }
+// Per process: CTest runs these tests in parallel processes.
+std::string Temp(const std::string& name) {
+  return ::testing::TempDir() + "/sluice_cli_" + std::to_string(getpid()) + "_" + name;
+}
 
 Outcome RunTool(const std::string& args, const std::string& stdinPath = "/dev/null") {
   const std::string out = Temp("stdout"), err = Temp("stderr");
