@@ -1,6 +1,9 @@
 // The read-only trace: each way a verdict is reached is reported as the walk
 // reaches it, with the deciding rule at the position the serialised ruleset
 // gives it, and tracing changes nothing the walk would see.
+#include <atomic>
+#include <thread>
+
 #include "firewall/fw_trace.h"
 #include "tests/firewall/packet_fixture.h"
 
@@ -127,6 +130,50 @@ TEST_F(Trace, NamesTheRuleTheWalkCountsAndCountsNothing) {
       }
     }
   }
+}
+
+}  // namespace
+
+namespace {
+
+using namespace fwpathtest;
+
+// Traces run beside walks that raise counters and beside rulesets being
+// replaced: each trace sees one whole ruleset, so every packet finds its
+// rule in its table, and the hold it takes never blocks the others for
+// good. Run under TSan for races.
+TEST_F(PacketPathTest, TraceRunsBesideWalksAndApplies) {
+  const std::string drop = "action=drop ipv4 proto=tcp dport=80\n" + ExactTcp4("drop");
+  const std::string accept = "action=accept ipv4 proto=tcp dport=80\n" + ExactTcp4("accept");
+  ApplyText(drop);
+  const Bytes exact = Tcp4(), general = Tcp4(9, 80);
+  std::atomic<bool> running{true};
+  std::thread walker([&] {
+    while (running.load()) {
+      host::PacketList list;
+      list.Append(host::Packets::Make(exact));
+      list.Append(host::Packets::Make(general));
+      (void)host::Sluice::Deliver(id_, list, 1);
+    }
+  });
+  std::thread applier([&] {
+    for (int i = 0; i < 200; i++) {
+      EXPECT_EQ(Apply(rules::ParseRuleset(i % 2 ? drop : accept)), ZEL_OK);
+    }
+  });
+  for (int i = 0; i < 2000; i++) {
+    ZelPkt* pkt = host::Packets::Make(i % 2 ? exact : general);
+    FWTrace t{};
+    ASSERT_EQ(FWTracePacket(filter_, pkt, 1, &t), ZEL_OK);
+    zel_PktRelease(pkt);
+    // A ruleset seen half applied would miss a rule or count one.
+    ASSERT_EQ(t.decision, i % 2 ? +FWTraceExactRule : +FWTraceGeneralRule);
+    ASSERT_EQ(t.numRules, 2u);
+    ASSERT_EQ(t.action, +t.rule.action);
+  }
+  applier.join();
+  running = false;
+  walker.join();
 }
 
 }  // namespace
