@@ -2,6 +2,7 @@
 
 #include <fmt/format.h>
 
+#include <algorithm>
 #include <cstring>
 
 #include "control/control.h"
@@ -365,6 +366,13 @@ std::string HowText(const PacketReport& p) {
 std::string EffectText(const PacketReport& p) {
   std::string s;
   for (Fate f : p.fates) s += (s.empty() ? "" : ", ") + FateText(f);
+  // A punt that did not reach the slow path: say why.
+  const bool punted = std::find(p.fates.begin(), p.fates.end(), Fate::SlowPath) != p.fates.end();
+  if (p.traced && p.trace.action == SLCGenericActionPunt && !punted) {
+    s += p.fates.size() == 1 && p.fates[0] == Fate::Dropped
+             ? " (no slow path attached; the failure policy drops)"
+             : " (no slow path attached; the failure policy passes)";
+  }
   if (!p.changes.empty()) {
     s += fmt::format("; {} byte{} changed:", p.changes.size(), p.changes.size() == 1 ? "" : "s");
     for (const ByteChange& c : p.changes) {
