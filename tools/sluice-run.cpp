@@ -1,32 +1,45 @@
 // sluice-run: loads the module into the userspace host, puts a filter on a
-// virtual NIC, optionally installs a ruleset through the agent's ruleset
-// property, pushes frames through the filter in both directions, and prints
-// what became of each packet and what the module logged.
+// virtual NIC, installs a ruleset, pushes captured frames through the filter
+// and shows, packet by packet, how the filter decided and what it did; then
+// every rule with its counters and the module log. Output captures receive
+// the frames that left toward the VM or the switch, the drops, the
+// slow-path copies and the GRE datagrams.
 //
-//   sluice-run                       built-in agent, ruleset and frames
-//   sluice-run --agent 'fw:default-action=ACTION_DROP' --no-rules
-//   sluice-run --rules examples/web.rules --capture examples/web.pcap
-//   sluice-run --slow-path --save-capture out.pcap
+//   sluice-run                                   built-in ruleset and frames
+//   sluice-run --rules examples/web.rules --capture in.pcapng --trace
+//   sluice-run --capture in.pcap --vm-mac 02:00:00:00:00:10 --out-switch out.pcap
+//   sluice-run --json --capture - < in.pcap
+//
+// Exit status: 0 when everything ran, 1 on an error (bad input, refused
+// ruleset, something the module left behind), 2 for a bad command line,
+// 3 when the capture was damaged and only the records before the damage
+// were replayed.
+
+#include <CLI/CLI.hpp>
+#include <fmt/format.h>
 
 #include <cstdio>
-#include <cstring>
+#include <filesystem>
 #include <fstream>
-#include <map>
-#include <set>
+#include <iostream>
+#include <iterator>
+#include <optional>
 #include <sstream>
 #include <string>
 #include <vector>
 
-#include "host/core/host_core.h"
-#include "host/net/packets.h"
-#include "host/sluice/framework.h"
-#include "module/module.h"
+#include "tools/lib/capture.h"
 #include "tools/lib/frames.h"
+#include "tools/lib/render.h"
 #include "tools/lib/ruleset_builder.h"
+#include "tools/lib/run.h"
 
 namespace {
 
-constexpr const char kDefaultAgentText[] = "sluice-demo:default-action=ACTION_PUNT";
+constexpr int kExitError = 1;
+constexpr int kExitUsage = 2;
+constexpr int kExitDamagedCapture = 3;
+constexpr size_t kMaxRulesText = 64u << 20;
 
 // The built-in ruleset: a small web server's policy.
 constexpr const char kDefaultRules[] = R"(ruleset version=8 features=1
@@ -43,70 +56,22 @@ action=drop ipv4 proto=tcp dport=23
 )";
 
 struct Options {
-  std::string agentText = kDefaultAgentText;
+  std::string agentText = runner::Config().agentText;
   std::string rulesPath;
   bool noRules = false;
   std::string capturePath;
-  std::string saveCapturePath;
+  std::string direction = "auto";
+  std::string vmMac, vmIp;
   bool slowPath = false;
-  bool quietLog = false;
   uint32_t failurePolicy = 0;
+  bool trace = false;
+  bool json = false;
+  bool quietLog = false;
+  bool noCounters = false;
+  std::string outVm, outSwitch, outDropped, outSlowPath, outGre;
+  uint32_t snapLen = 262144;
+  std::string greSource = "192.0.2.1";
 };
-
-void Usage() {
-  std::printf(
-      "usage: sluice-run [options]\n"
-      "  --agent TEXT          agent create text, NAME[:default-action=ACTION_...]\n"
-      "                        (default: %s)\n"
-      "  --rules FILE          ruleset in the rule text syntax (default: built-in)\n"
-      "  --no-rules            no ruleset: every packet gets the default action\n"
-      "  --capture FILE        pcap capture to push (default: built-in frames)\n"
-      "  --save-capture FILE   write the frames pushed as a pcap capture\n"
-      "  --slow-path           register slow path #1 and attach the filter\n"
-      "  --failure-policy N    filter failure policy (default 0)\n"
-      "  --quiet-log           do not print the module log\n",
-      kDefaultAgentText);
-}
-
-bool ParseArgs(int argc, char** argv, Options* o) {
-  for (int i = 1; i < argc; i++) {
-    std::string a = argv[i];
-    auto value = [&](std::string* out) {
-      if (i + 1 >= argc) {
-        std::fprintf(stderr, "sluice-run: %s needs a value\n", a.c_str());
-        return false;
-      }
-      *out = argv[++i];
-      return true;
-    };
-    std::string v;
-    if (a == "--agent") {
-      if (!value(&o->agentText)) return false;
-    } else if (a == "--rules") {
-      if (!value(&o->rulesPath)) return false;
-    } else if (a == "--no-rules") {
-      o->noRules = true;
-    } else if (a == "--capture") {
-      if (!value(&o->capturePath)) return false;
-    } else if (a == "--save-capture") {
-      if (!value(&o->saveCapturePath)) return false;
-    } else if (a == "--slow-path") {
-      o->slowPath = true;
-    } else if (a == "--failure-policy") {
-      if (!value(&v)) return false;
-      o->failurePolicy = static_cast<uint32_t>(std::strtoul(v.c_str(), nullptr, 0));
-    } else if (a == "--quiet-log") {
-      o->quietLog = true;
-    } else if (a == "--help" || a == "-h") {
-      Usage();
-      std::exit(0);
-    } else {
-      std::fprintf(stderr, "sluice-run: unknown option %s (try --help)\n", a.c_str());
-      return false;
-    }
-  }
-  return true;
-}
 
 std::vector<frames::CaptureRecord> DefaultFrames() {
   using frames::FrameBuilder;
@@ -115,7 +80,8 @@ std::vector<frames::CaptureRecord> DefaultFrames() {
   const auto vm = Mac("02:00:00:00:00:10");
   const auto gw = Mac("02:00:00:00:00:01");
   std::vector<frames::CaptureRecord> out;
-  auto add = [&](uint32_t dir, const frames::Bytes& f) { out.push_back({dir, f, 0}); };
+  int64_t t = 1700000000;
+  auto add = [&](uint32_t dir, const frames::Bytes& f) { out.push_back({dir, f, 0, t++, 0}); };
   add(1, FrameBuilder().Eth(vm, gw).Ipv4(Ip4("10.0.0.1"), Ip4("10.0.0.10")).Tcp(40000, 80,
                                                                                 frames::kTcpSyn)
              .Build());
@@ -133,7 +99,8 @@ std::vector<frames::CaptureRecord> DefaultFrames() {
              .Build());
   add(2, FrameBuilder().Eth(gw, vm).Ipv4(Ip4("10.0.0.10"), Ip4("10.0.0.99")).Tcp(45000, 23)
              .Build());
-  add(2, FrameBuilder().Eth(Mac("01:80:c2:00:00:00"), vm).EtherType(0x0027).Payload(46).Build());
+  add(2, FrameBuilder().Eth(Mac("01:80:c2:00:00:00"), vm).Llc().EtherType(0x0027).Payload(38)
+             .Build());
   add(2, FrameBuilder().Eth(gw, vm).Arp(1, vm, Ip4("10.0.0.10"), Mac("00:00:00:00:00:00"),
                                         Ip4("10.0.0.1"))
              .Build());
@@ -143,195 +110,272 @@ std::vector<frames::CaptureRecord> DefaultFrames() {
   return out;
 }
 
-// A one-line description of a frame for the report.
-std::string Describe(const frames::Bytes& f) {
-  char buf[160];
-  if (f.size() < 14) return "runt frame (" + std::to_string(f.size()) + " bytes)";
-  size_t off = 12;
-  uint16_t type = static_cast<uint16_t>((f[off] << 8) | f[off + 1]);
-  if (type == 0x8100 && f.size() >= 18) {
-    off = 16;
-    type = static_cast<uint16_t>((f[off] << 8) | f[off + 1]);
-  }
-  size_t l3 = off + 2;
-  auto port = [&](size_t at) { return (f[at] << 8) | f[at + 1]; };
-  if (type == 0x0800 && f.size() >= l3 + 20) {
-    size_t l4 = l3 + 4 * (f[l3] & 0xf);
-    uint8_t proto = f[l3 + 9];
-    std::snprintf(buf, sizeof(buf), "IPv4 %u.%u.%u.%u > %u.%u.%u.%u", f[l3 + 12], f[l3 + 13],
-                  f[l3 + 14], f[l3 + 15], f[l3 + 16], f[l3 + 17], f[l3 + 18], f[l3 + 19]);
-    std::string s = buf;
-    if ((proto == 6 || proto == 17) && f.size() >= l4 + 4) {
-      s += (proto == 6 ? " tcp " : " udp ") + std::to_string(port(l4)) + " > " +
-           std::to_string(port(l4 + 2));
-    } else {
-      s += " proto " + std::to_string(proto);
-    }
-    return s;
-  }
-  if (type == 0x86dd && f.size() >= l3 + 40) {
-    uint8_t nh = f[l3 + 6];
-    std::string s = "IPv6";
-    if ((nh == 6 || nh == 17) && f.size() >= l3 + 44) {
-      s += (nh == 6 ? " tcp " : " udp ") + std::to_string(port(l3 + 40)) + " > " +
-           std::to_string(port(l3 + 42));
-    } else {
-      s += " next header " + std::to_string(nh);
-    }
-    return s;
-  }
-  std::snprintf(buf, sizeof(buf), "ethertype 0x%04x to %02x:%02x:%02x:%02x:%02x:%02x", type, f[0],
-                f[1], f[2], f[3], f[4], f[5]);
-  return buf;
+// A one-line error and the status to exit with.
+int Fail(const std::string& what, int status = kExitError) {
+  std::fprintf(stderr, "sluice-run: %s\n", what.c_str());
+  return status;
 }
 
-bool ReadFile(const std::string& path, std::string* out) {
+// The text of `path` ("-" = standard input); nullopt with *error set for a
+// directory, an unreadable file or one too large.
+std::optional<std::string> ReadText(const std::string& path, std::string* error) {
+  if (path == "-") {
+    std::string s(std::istreambuf_iterator<char>(std::cin), {});
+    return s;
+  }
+  std::error_code ec;
+  if (std::filesystem::is_directory(path, ec)) {
+    *error = path + ": is a directory, not a ruleset file";
+    return std::nullopt;
+  }
   std::ifstream in(path, std::ios::binary);
-  if (!in) return false;
-  std::stringstream ss;
+  if (!in) {
+    *error = path + ": cannot open";
+    return std::nullopt;
+  }
+  const auto size = std::filesystem::file_size(path, ec);
+  if (!ec && size > kMaxRulesText) {
+    *error = path + ": larger than 64 MiB";
+    return std::nullopt;
+  }
+  std::ostringstream ss;
   ss << in.rdbuf();
-  *out = ss.str();
+  return ss.str();
+}
+
+bool ParseMac(const std::string& text, frames::MacAddr* mac) {
+  unsigned b[6];
+  char tail;
+  if (std::sscanf(text.c_str(), "%x:%x:%x:%x:%x:%x%c", &b[0], &b[1], &b[2], &b[3], &b[4], &b[5],
+                  &tail) != 6) {
+    return false;
+  }
+  for (int i = 0; i < 6; i++) {
+    if (b[i] > 0xff) return false;
+    (*mac)[i] = static_cast<uint8_t>(b[i]);
+  }
   return true;
 }
 
-std::string AgentName(const std::string& createText) {
-  return createText.substr(0, createText.find(':'));
+bool ParseIp4(const std::string& text, frames::Ip4Addr* ip) {
+  unsigned b[4];
+  char tail;
+  if (std::sscanf(text.c_str(), "%u.%u.%u.%u%c", &b[0], &b[1], &b[2], &b[3], &tail) != 4) {
+    return false;
+  }
+  for (int i = 0; i < 4; i++) {
+    if (b[i] > 0xff) return false;
+    (*ip)[i] = static_cast<uint8_t>(b[i]);
+  }
+  return true;
 }
+
+// An IPv6 literal through the rule syntax's own parser, so both accept the
+// same text.
+bool ParseIp6(const std::string& text, frames::Ip6Addr* ip) {
+  FWRule rule;
+  std::string error;
+  if (!rules::TryParseRule("ipv6 sa=" + text, &rule, &error)) return false;
+  std::copy(rule.ipSa, rule.ipSa + 16, ip->begin());
+  return true;
+}
+
+struct Output {
+  const std::string* path;
+  const std::vector<frames::CaptureRecord>* records;
+  frames::LinkType link;
+};
 
 }  // namespace
 
 int main(int argc, char** argv) {
   Options o;
-  if (!ParseArgs(argc, argv, &o)) return 2;
+  CLI::App app{"Runs captured frames through the module's filter and shows what it did.",
+               "sluice-run"};
+  app.add_option("--agent", o.agentText, "agent create text, NAME[:default-action=ACTION_...]")
+      ->capture_default_str();
+  app.add_option("--rules", o.rulesPath,
+                 "ruleset in the rule text syntax (- = standard input; default: built-in)");
+  app.add_flag("--no-rules", o.noRules, "no ruleset: every packet gets the default action");
+  app.add_option("--capture", o.capturePath,
+                 "pcap or pcapng capture to push (- = standard input; default: built-in)");
+  app.add_option("--direction", o.direction,
+                 "direction of records whose capture does not give one: from (the switch), "
+                 "to (the switch) or auto (by --vm-mac/--vm-ip)")
+      ->check(CLI::IsMember({"from", "to", "auto"}))
+      ->capture_default_str();
+  app.add_option("--vm-mac", o.vmMac, "MAC address of the VM side, for --direction auto");
+  app.add_option("--vm-ip", o.vmIp, "IPv4 or IPv6 address of the VM side, for --direction auto");
+  app.add_flag("--slow-path", o.slowPath, "register slow path #1 and attach the filter");
+  app.add_option("--failure-policy", o.failurePolicy, "filter failure policy (0 drop, 1 pass)")
+      ->check(CLI::Range(0u, 1u))
+      ->capture_default_str();
+  app.add_flag("--trace", o.trace, "show how each verdict was reached and what it did");
+  app.add_flag("--json", o.json, "print one JSON document instead of text");
+  app.add_flag("--quiet-log", o.quietLog, "do not show the module log");
+  app.add_flag("--no-counters", o.noCounters, "do not list the rules' counters");
+  app.add_option("--out-vm", o.outVm, "write frames leaving toward the VM (pcap; - = stdout)");
+  app.add_option("--out-switch", o.outSwitch, "write frames leaving toward the switch");
+  app.add_option("--out-dropped", o.outDropped, "write the dropped frames");
+  app.add_option("--out-slow-path", o.outSlowPath, "write slow-path copies and punts");
+  app.add_option("--out-gre", o.outGre, "write GRE datagrams as their receiver sees them (raw IPv4)");
+  app.add_option("--snap-len", o.snapLen, "snap length of the output captures")
+      ->check(CLI::Range(1u, 262144u))
+      ->capture_default_str();
+  app.add_option("--gre-source", o.greSource, "outer source address of GRE datagrams")
+      ->capture_default_str();
+  try {
+    app.parse(argc, argv);
+  } catch (const CLI::ParseError& e) {
+    if (e.get_exit_code() == 0) return app.exit(e);
+    return Fail(std::string(e.what()) + " (try --help)", kExitUsage);
+  }
 
-  std::vector<uint8_t> ruleset;
+  // Inputs.
+  if (o.rulesPath == "-" && o.capturePath == "-") {
+    return Fail("--rules and --capture cannot both read standard input", kExitUsage);
+  }
+  const Output outputs[] = {
+      {&o.outVm, nullptr, frames::LinkType::Ethernet},
+      {&o.outSwitch, nullptr, frames::LinkType::Ethernet},
+      {&o.outDropped, nullptr, frames::LinkType::Ethernet},
+      {&o.outSlowPath, nullptr, frames::LinkType::Ethernet},
+      {&o.outGre, nullptr, frames::LinkType::RawIpv4},
+  };
+  int toStdout = o.json ? 1 : 0;
+  for (const Output& out : outputs) toStdout += *out.path == "-" ? 1 : 0;
+  if (toStdout > 1) return Fail("only one output can go to standard output", kExitUsage);
+
+  frames::DirectionRule directionRule;
+  if (o.direction == "from") directionRule.fixed = frames::kDirectionFromSwitch;
+  if (o.direction == "to") directionRule.fixed = frames::kDirectionToSwitch;
+  if (!o.vmMac.empty()) {
+    frames::MacAddr mac;
+    if (!ParseMac(o.vmMac, &mac)) return Fail("--vm-mac: not a MAC address: " + o.vmMac, kExitUsage);
+    directionRule.vmMac = mac;
+  }
+  if (!o.vmIp.empty()) {
+    frames::Ip4Addr ip4;
+    frames::Ip6Addr ip6;
+    if (ParseIp4(o.vmIp, &ip4)) {
+      directionRule.vmIp4 = ip4;
+    } else if (o.vmIp.find(':') != std::string::npos && ParseIp6(o.vmIp, &ip6)) {
+      directionRule.vmIp6 = ip6;
+    } else {
+      return Fail("--vm-ip: not an IPv4 or IPv6 address: " + o.vmIp, kExitUsage);
+    }
+  }
+
+  runner::Config config;
+  config.agentText = o.agentText;
+  config.slowPath = o.slowPath;
+  config.failurePolicy = o.failurePolicy;
+  if (!ParseIp4(o.greSource, &config.greSource)) {
+    return Fail("--gre-source: not an IPv4 address: " + o.greSource, kExitUsage);
+  }
   if (!o.noRules) {
     std::string text = kDefaultRules;
-    if (!o.rulesPath.empty() && !ReadFile(o.rulesPath, &text)) {
-      std::fprintf(stderr, "sluice-run: cannot read %s\n", o.rulesPath.c_str());
-      return 1;
+    if (!o.rulesPath.empty()) {
+      std::string error;
+      std::optional<std::string> read = ReadText(o.rulesPath, &error);
+      if (!read) return Fail(error);
+      text = std::move(*read);
     }
-    try {
-      ruleset = rules::RulesetBuilder().AddText(text).Bytes();
-    } catch (const rules::RuleError& e) {
-      std::fprintf(stderr, "sluice-run: %s: %s\n",
-                   o.rulesPath.empty() ? "built-in rules" : o.rulesPath.c_str(), e.what());
-      return 1;
+    std::string error;
+    if (!rules::TryParseRuleset(text, &config.ruleset, &error)) {
+      return Fail((o.rulesPath.empty() ? std::string("built-in rules") : o.rulesPath) + ": " +
+                  error);
     }
   }
 
-  std::vector<frames::CaptureRecord> records;
+  int exitStatus = 0;
+  std::string captureWarning;
   if (o.capturePath.empty()) {
-    records = DefaultFrames();
+    config.records = DefaultFrames();
   } else {
-    std::string error;
-    if (!frames::ReadCapture(o.capturePath, &records, &error)) {
-      std::fprintf(stderr, "sluice-run: %s: %s\n", o.capturePath.c_str(), error.c_str());
-      return 1;
+    frames::CaptureRead read = frames::ReadCapture(o.capturePath);
+    if (!read.ok() && !read.badRecord) return Fail(o.capturePath + ": " + read.error);
+    if (!read.ok()) {
+      captureWarning = o.capturePath + ": " + read.error + "; replaying the " +
+                       std::to_string(read.records.size()) + " records before it";
+      exitStatus = kExitDamagedCapture;
+    }
+    config.records = std::move(read.records);
+    if (std::optional<size_t> bad = frames::ResolveDirections(&config.records, directionRule)) {
+      return Fail(fmt::format("{}: record {} has no direction (the capture records none; give "
+                              "--direction, --vm-mac or --vm-ip)",
+                              o.capturePath, *bad + 1));
     }
   }
-  if (!o.saveCapturePath.empty()) {
+  if (!captureWarning.empty()) std::fprintf(stderr, "sluice-run: %s\n", captureWarning.c_str());
+
+  // Output captures are opened before the run, so a bad path costs nothing.
+  std::vector<frames::CaptureWriter> writers(std::size(outputs));
+  for (size_t i = 0; i < std::size(outputs); i++) {
+    if (outputs[i].path->empty()) continue;
     std::string error;
-    if (!frames::WriteCapture(o.saveCapturePath, records, &error)) {
-      std::fprintf(stderr, "sluice-run: %s: %s\n", o.saveCapturePath.c_str(), error.c_str());
-      return 1;
+    if (!writers[i].Open(*outputs[i].path, outputs[i].link, o.snapLen, &error)) {
+      return Fail(*outputs[i].path + ": " + error);
     }
   }
 
-  host::Reset();
-  host::Timers::SetMode(host::TimerMode::Manual);
-  if (host::Loader::Load(&slcGenericModuleImage) != 0) {
-    std::fprintf(stderr, "sluice-run: the module did not start\n");
-    for (const auto& r : host::Log::Records()) std::fprintf(stderr, "  %s", r.rendered.c_str());
-    return 1;
+  const runner::Result result = runner::Run(config);
+  if (!result.error.empty()) return Fail(result.error);
+
+  const std::vector<frames::CaptureRecord>* produced[] = {
+      &result.outputs.toVm, &result.outputs.toSwitch, &result.outputs.dropped,
+      &result.outputs.slowPath, &result.outputs.gre};
+  for (size_t i = 0; i < std::size(outputs); i++) {
+    if (!writers[i].IsOpen()) continue;
+    for (const frames::CaptureRecord& r : *produced[i]) writers[i].Write(r);
+    std::string error;
+    if (!writers[i].Close(&error)) {
+      std::fprintf(stderr, "sluice-run: %s: %s\n", outputs[i].path->c_str(), error.c_str());
+      exitStatus = kExitError;
+    }
   }
 
-  const std::string agent = AgentName(o.agentText);
-  int rc = 0;
-  ZelStatus status = host::ClientPorts::Write(kSLCGenericCreateAgentPropName, o.agentText);
-  host::FilterId filter = 0;
-  if (status != ZEL_OK || !host::Sluice::AgentRegistered(agent)) {
-    std::fprintf(stderr, "sluice-run: agent '%s' was not created (%#x)\n", agent.c_str(), status);
-    rc = 1;
+  const bool textToStderr = toStdout > 0 && !o.json;
+  FILE* text = textToStderr ? stderr : stdout;
+  if (o.json) {
+    nlohmann::json doc;
+    doc["schema"] = render::kJsonSchema;
+    doc["tool"] = "sluice-run";
+    if (!config.ruleset.empty()) {
+      doc["ruleset"] = {{"status", result.rulesetStatus}, {"bytes", config.ruleset.size()}};
+    }
+    if (!captureWarning.empty()) doc["captureError"] = captureWarning;
+    nlohmann::json packets = nlohmann::json::array();
+    for (const render::PacketReport& p : result.packets) packets.push_back(render::PacketJson(p));
+    doc["packets"] = packets;
+    if (!o.noCounters) doc["counters"] = render::CountersJson(result.counters);
+    if (!o.quietLog) doc["log"] = render::LogJson(result.log);
+    doc["leftovers"] = result.leftovers;
+    std::string s = doc.dump(2, ' ', false, nlohmann::json::error_handler_t::replace);
+    std::fprintf(stdout, "%s\n", s.c_str());
   } else {
-    host::FilterConfig config;
-    config.name = "vm1.eth0";
-    config.vmUUID = "564d-demo-vm1";
-    config.failurePolicy = o.failurePolicy;
-    status = host::Sluice::CreateFilter(agent, config, &filter);
-    if (status != ZEL_OK) {
-      std::fprintf(stderr, "sluice-run: filter not created (%#x)\n", status);
-      rc = 1;
+    if (!config.ruleset.empty()) {
+      std::fprintf(text, "ruleset of %zu bytes written: %s\n\n", config.ruleset.size(),
+                   result.rulesetStatus.c_str());
     }
-  }
-
-  if (rc == 0 && o.slowPath) {
-    (void)host::Sluice::RegisterSlowPath(agent, 1);
-    host::Timers::RunDue();
-  }
-  if (rc == 0 && !ruleset.empty()) {
-    status = host::Sluice::PropertyWrite(agent + ".ruleset", filter, ruleset);
-    std::printf("ruleset of %zu bytes written to %s.ruleset: %s\n", ruleset.size(), agent.c_str(),
-                zel_StatusToString(status));
-    if (status != ZEL_OK) rc = 1;
-  }
-
-  if (rc == 0) {
-    std::printf("\n%-3s %-5s %-48s %s\n", "#", "dir", "frame", "fate");
-    for (size_t i = 0; i < records.size(); i++) {
-      const frames::CaptureRecord& rec = records[i];
-      uint32_t dir = rec.direction == 2 ? 2 : 1;
-      host::PacketList list;
-      ZelPkt* pkt = host::Packets::Make(rec.frame);
-      uint64_t serial = host::Packets::Serial(pkt);
-      list.Append(pkt);
-      size_t gre = host::Sockets::Sent().size();
-      ZelStatus st = host::Sluice::Deliver(filter, list, dir);
-
-      std::vector<std::string> fate;
-      for (ZelPkt* p : list.Packets()) {
-        if (host::Packets::Serial(p) == serial) fate.push_back("passed");
-      }
-      for (auto& d : host::Sluice::TakeFaulted(filter)) {
-        for (ZelPkt* p : d.packets) {
-          if (host::Packets::Serial(p) == serial) fate.push_back("to slow path");
-          zel_PktRelease(p);
-        }
-      }
-      for (auto& d : host::Sluice::TakeIssued(filter)) {
-        for (ZelPkt* p : d.packets) {
-          if (host::Packets::Serial(p) == serial) fate.push_back("turned back to switch");
-          zel_PktRelease(p);
-        }
-      }
-      size_t sent = host::Sockets::Sent().size() - gre;
-      if (sent > 0) fate.push_back("GRE copy sent");
-      if (fate.empty()) fate.push_back("dropped");
-      std::string text;
-      for (const auto& f : fate) text += (text.empty() ? "" : ", ") + f;
-      if (st != ZEL_OK) text += std::string(" (status ") + zel_StatusToString(st) + ")";
-      std::printf("%-3zu %-5s %-48s %s\n", i + 1, dir == 1 ? "from" : "to",
-                  Describe(rec.frame).c_str(), text.c_str());
+    std::fprintf(text, "%-4s %-4s %-60s %s\n", "#", "dir", "frame", "verdict");
+    for (const render::PacketReport& p : result.packets) {
+      std::fputs(render::PacketText(p, o.trace).c_str(), text);
     }
+    if (!o.noCounters) {
+      std::fprintf(text, "\ncounters:\n%s", render::CountersText(result.counters).c_str());
+    }
+    if (!o.quietLog) std::fprintf(text, "\nmodule log:\n%s", render::LogText(result.log).c_str());
   }
 
-  if (!o.quietLog) {
-    std::printf("\nmodule log:\n");
-    for (const auto& r : host::Log::Records()) {
-      std::printf("  [%d] %s", r.urgency, r.rendered.c_str());
-    }
+  if (result.rulesetRefused) {
+    std::fprintf(stderr, "sluice-run: the module refused the ruleset (%s)\n",
+                 result.rulesetStatus.c_str());
+    exitStatus = kExitError;
   }
-
-  if (filter != 0) {
-    while (host::Sluice::DestroyFilter(filter) == ZEL_BUSY) {
-      host::Sluice::ReleaseReplies(host::RequestKind::SetSlowPath);
-    }
-  }
-  host::Loader::Unload();
-  for (const std::string& what : host::Leftovers()) {
+  for (const std::string& what : result.leftovers) {
     std::fprintf(stderr, "sluice-run: left behind: %s\n", what.c_str());
-    rc = 1;
+    exitStatus = kExitError;
   }
-  host::Reset();
-  return rc;
+  return exitStatus;
 }

@@ -1,5 +1,4 @@
-// The frame builder's checksums, checked by independent arithmetic, and a
-// capture file written and read back.
+// The frame builder's checksums, checked by independent arithmetic.
 #include "tools/lib/frames.h"
 
 #include <gtest/gtest.h>
@@ -42,29 +41,6 @@ TEST(FrameChecksum, HeadersAndTransportOverTheirPseudoHeaders) {
 
   const Bytes icmp = FrameBuilder().Ipv4({}, {}).Icmp(8, 0, 0x00010002).Payload(5).Build();
   EXPECT_EQ(OnesSum(icmp, 20, 13), 0xffff);  // no pseudo header for ICMPv4
-}
-
-TEST(Capture, ClassicPcapLayoutAndRoundTrip) {
-  const std::vector<frames::CaptureRecord> in = {
-      {1, FrameBuilder().Ipv4({}, {}).Build(), 0},
-      {2, Bytes{1, 2, 3}, 1500},
-  };
-  const Bytes enc = frames::EncodeCapture(in);
-  ASSERT_EQ(enc.size(), 24u + 16 + 20 + 16 + 3);
-  EXPECT_EQ(frames::Hex(std::span(enc).first(24)),
-            "d4 c3 b2 a1 02 00 04 00 00 00 00 00 00 00 00 00 ff ff 00 00 01 00 00 00");
-  // Second record: seconds 1, microseconds = direction 2, lengths 3 and 1500.
-  EXPECT_EQ(frames::Hex(std::span(enc).subspan(60, 16)),
-            "01 00 00 00 02 00 00 00 03 00 00 00 dc 05 00 00");
-
-  const std::string path = ::testing::TempDir() + "/frames_roundtrip.pcap";
-  ASSERT_TRUE(frames::WriteCapture(path, in));
-  std::vector<frames::CaptureRecord> out;
-  std::string err;
-  ASSERT_TRUE(frames::ReadCapture(path, &out, &err)) << err;
-  std::remove(path.c_str());
-  ASSERT_EQ(out.size(), 2u);
-  EXPECT_EQ(frames::EncodeCapture(out), enc);
 }
 
 }  // namespace

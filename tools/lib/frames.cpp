@@ -3,8 +3,6 @@
 #include <algorithm>
 #include <cstdio>
 #include <cstdlib>
-#include <fstream>
-#include <iterator>
 
 namespace frames {
 
@@ -552,122 +550,6 @@ Bytes FrameBuilder::Build() const {
   frame.insert(frame.end(), l3.begin(), l3.end());
   if (frame.size() < padTo_) frame.resize(padTo_, 0);
   return frame;
-}
-
-// --- Captures ---------------------------------------------------------------------
-
-namespace {
-
-constexpr uint32_t kPcapMagicMicro = 0xa1b2c3d4;
-constexpr uint32_t kPcapMagicNano = 0xa1b23c4d;
-constexpr uint32_t kPcapSnapLen = 65535;
-constexpr uint32_t kLinkTypeEthernet = 1;
-// Larger records are refused as corrupt rather than allocated.
-constexpr uint32_t kMaxRecord = 256 * 1024;
-
-void PutLe16(Bytes* out, uint16_t v) {
-  out->push_back(static_cast<uint8_t>(v));
-  out->push_back(static_cast<uint8_t>(v >> 8));
-}
-void PutLe32(Bytes* out, uint32_t v) {
-  PutLe16(out, static_cast<uint16_t>(v));
-  PutLe16(out, static_cast<uint16_t>(v >> 16));
-}
-uint32_t GetLe32(const uint8_t* p) {
-  return static_cast<uint32_t>(p[0]) | static_cast<uint32_t>(p[1]) << 8 |
-         static_cast<uint32_t>(p[2]) << 16 | static_cast<uint32_t>(p[3]) << 24;
-}
-uint32_t Swap32(uint32_t v) { return __builtin_bswap32(v); }
-
-bool Fail(std::string* error, const std::string& why) {
-  if (error != nullptr) *error = why;
-  return false;
-}
-
-}  // namespace
-
-Bytes EncodeCapture(std::span<const CaptureRecord> records) {
-  Bytes out;
-  PutLe32(&out, kPcapMagicMicro);
-  PutLe16(&out, 2);
-  PutLe16(&out, 4);
-  PutLe32(&out, 0);  // this zone
-  PutLe32(&out, 0);  // sigfigs
-  PutLe32(&out, kPcapSnapLen);
-  PutLe32(&out, kLinkTypeEthernet);
-  uint32_t index = 0;
-  for (const CaptureRecord& r : records) {
-    uint32_t incl = static_cast<uint32_t>(std::min<size_t>(r.frame.size(), kPcapSnapLen));
-    uint32_t orig = r.origLen != 0 ? r.origLen : static_cast<uint32_t>(r.frame.size());
-    PutLe32(&out, index++);
-    PutLe32(&out, r.direction);
-    PutLe32(&out, incl);
-    PutLe32(&out, orig);
-    out.insert(out.end(), r.frame.begin(), r.frame.begin() + incl);
-  }
-  return out;
-}
-
-bool DecodeCapture(std::span<const uint8_t> data, std::vector<CaptureRecord>* records,
-                   std::string* error) {
-  records->clear();
-  if (data.size() < 24) return Fail(error, "file shorter than a pcap header");
-  uint32_t magic = GetLe32(data.data());
-  bool swap;
-  if (magic == kPcapMagicMicro || magic == kPcapMagicNano) {
-    swap = false;
-  } else if (Swap32(magic) == kPcapMagicMicro || Swap32(magic) == kPcapMagicNano) {
-    swap = true;
-  } else {
-    return Fail(error, "not a classic pcap file");
-  }
-  auto get32 = [swap](const uint8_t* p) { return swap ? Swap32(GetLe32(p)) : GetLe32(p); };
-  // The upper bits of the link type field may carry FCS information.
-  uint32_t linkType = get32(data.data() + 20) & 0x0fffffff;
-  if (linkType != kLinkTypeEthernet) {
-    return Fail(error, "link type " + std::to_string(linkType) + " is not Ethernet");
-  }
-  size_t pos = 24;
-  while (pos < data.size()) {
-    if (data.size() - pos < 16) return Fail(error, "truncated record header");
-    const uint8_t* h = data.data() + pos;
-    uint32_t frac = get32(h + 4);
-    uint32_t incl = get32(h + 8);
-    uint32_t orig = get32(h + 12);
-    pos += 16;
-    if (incl > kMaxRecord) return Fail(error, "record length " + std::to_string(incl));
-    if (data.size() - pos < incl) return Fail(error, "truncated record");
-    CaptureRecord r;
-    r.direction = (frac == 1 || frac == 2) ? frac : 0;
-    r.frame.assign(data.begin() + static_cast<ptrdiff_t>(pos),
-                   data.begin() + static_cast<ptrdiff_t>(pos + incl));
-    r.origLen = orig;
-    records->push_back(std::move(r));
-    pos += incl;
-  }
-  return true;
-}
-
-bool WriteCapture(const std::string& path, std::span<const CaptureRecord> records,
-                  std::string* error) {
-  Bytes bytes = EncodeCapture(records);
-  std::ofstream out(path, std::ios::binary | std::ios::trunc);
-  if (!out) return Fail(error, "cannot open " + path + " for writing");
-  out.write(reinterpret_cast<const char*>(bytes.data()), static_cast<std::streamsize>(bytes.size()));
-  out.close();
-  if (!out) return Fail(error, "write to " + path + " failed");
-  return true;
-}
-
-bool ReadCapture(const std::string& path, std::vector<CaptureRecord>* records,
-                 std::string* error) {
-  std::ifstream in(path, std::ios::binary);
-  if (!in) {
-    records->clear();
-    return Fail(error, "cannot open " + path);
-  }
-  Bytes bytes((std::istreambuf_iterator<char>(in)), std::istreambuf_iterator<char>());
-  return DecodeCapture(bytes, records, error);
 }
 
 std::string Hex(std::span<const uint8_t> bytes) {

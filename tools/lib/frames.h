@@ -22,12 +22,7 @@
 //       Fragment6, RawExt), or Arp, or EtherType + Payload for anything else.
 //   L4: Tcp, Udp, Icmp, Icmp6, or IpProto for a bare protocol number.
 //
-// Capture files use the classic pcap format with link type Ethernet, so any
-// packet analyser opens them. Classic pcap has no per-record direction; this
-// library stores it in the microseconds field of each record's timestamp
-// (1 = from the switch, 2 = to the switch) and numbers the seconds by record
-// index. Captures from elsewhere read back with direction 0 unless their
-// microseconds happen to be 1 or 2.
+// Captures are read and written by tools/lib/capture.h.
 #pragma once
 
 #include <array>
@@ -217,28 +212,18 @@ class FrameBuilder {
   size_t padTo_ = 0;
 };
 
-// ---------------------------------------------------------------------------
-// Captures
+// One captured frame (tools/lib/capture.h reads and writes them).
+inline constexpr uint32_t kDirectionUnknown = 0;
+inline constexpr uint32_t kDirectionFromSwitch = 1;
+inline constexpr uint32_t kDirectionToSwitch = 2;
 
 struct CaptureRecord {
-  uint32_t direction = 0;   // 1 from the switch, 2 to the switch, 0 unknown
+  uint32_t direction = kDirectionUnknown;
   Bytes frame;              // the bytes captured
   uint32_t origLen = 0;     // length on the wire; 0 = frame.size()
+  int64_t tsSec = 0;        // timestamp, seconds since the epoch
+  uint32_t tsNsec = 0;      // and nanoseconds
 };
-
-// Classic pcap (little-endian, microsecond timestamps, snap length 65535,
-// link type 1). Records longer than 65535 bytes are cut to it, keeping their
-// original length.
-Bytes EncodeCapture(std::span<const CaptureRecord> records);
-// Reads classic pcap of either byte order, microsecond or nanosecond
-// timestamps, link type 1 only. On failure returns false with a reason in
-// *error and leaves *records with the records read before the fault.
-bool DecodeCapture(std::span<const uint8_t> data, std::vector<CaptureRecord>* records,
-                   std::string* error = nullptr);
-bool WriteCapture(const std::string& path, std::span<const CaptureRecord> records,
-                  std::string* error = nullptr);
-bool ReadCapture(const std::string& path, std::vector<CaptureRecord>* records,
-                 std::string* error = nullptr);
 
 // "00 11 22 ..." for test messages.
 std::string Hex(std::span<const uint8_t> bytes);
