@@ -192,12 +192,18 @@ ZelStatus FWScanIndexBuild(const ListLinks* ruleList, FWScanIndex** index) {
     idx->entries[i] = entry;
   }
   idx->count = i;
+  idx->classifier = nullptr;
+  if (FWClassifierBuild(idx->entries, idx->count, &idx->classifier) != ZEL_OK) {
+    SLCGenericFree(block);
+    return ZEL_NO_MEMORY;
+  }
   *index = idx;
   return ZEL_OK;
 }
 
 void FWScanIndexFree(FWScanIndex** index) {
   if (*index != nullptr) {
+    FWClassifierFree(&(*index)->classifier);
     SLCGenericFree(*index);
     *index = nullptr;
   }
@@ -208,6 +214,14 @@ void FWScanIndexForget(FWScanIndex* index, const FWRuleEntry* entry) {
   if (index == nullptr || (entry->rule.ruleFlags & FW_GENERAL_RULE_MASK) == 0) return;
   for (uint32_t i = 0; i < index->count; i++) {
     if (index->entries[i] != entry) continue;
+    if (index->classifier != nullptr) {
+      FWScanSlot& slot = index->slots[i];
+      slot = FWScanSlot{};
+      slot.value[0] = FW_KEY0_NEVER;
+      slot.mask[0] = FW_KEY0_NEVER;
+      index->entries[i] = nullptr;
+      return;
+    }
     // Compact in place, front to back, keeping ruleset order.
     for (uint32_t j = i + 1; j < index->count; j++) {
       index->slots[j - 1] = index->slots[j];

@@ -18,10 +18,13 @@
 // the rule is exactly the masked equality and passing it is matching.
 //
 // Invariant (configLock): while the filter has general rules, scanIndex
-// lists exactly the entries of ruleList, back to front (ruleset order); with
-// none it is null or empty.
+// lists exactly the entries of ruleList, back to front (ruleset order), and
+// slots of entries removed since it was built (entries[i] null, slot never
+// passing); with none it is null or empty. A large index carries the
+// compiled classifier (fw_classifier.h) of its slots.
 #pragma once
 
+#include "firewall/fw_classifier.h"
 #include "firewall/fw_rules.h"
 
 struct FWScanSlot {
@@ -35,6 +38,7 @@ struct FWScanIndex {
   uint32_t capacity;
   FWScanSlot* slots;       // inside this block, 64-byte aligned
   FWRuleEntry** entries;   // inside this block; entries[i] belongs to slots[i]
+  FWClassifier* classifier;  // separate block, or null: scan every slot
 };
 
 // Key word 0: ports and protocol as stored, presence bits 0-9, the family
@@ -75,10 +79,13 @@ inline uint64_t FWFold32(uint64_t rawHi, uint64_t rawLo) {
 }
 
 // Builds the index of `ruleList` (entries linked at the front, so walked
-// from the back). An empty list yields null and ZEL_OK. ZEL_NO_MEMORY when
-// the block cannot be allocated; nothing is then allocated.
+// from the back), with its classifier. An empty list yields null and
+// ZEL_OK. ZEL_NO_MEMORY when an allocation fails; nothing is then
+// allocated.
 [[nodiscard]] ZelStatus FWScanIndexBuild(const ListLinks* ruleList, FWScanIndex** index);
 void FWScanIndexFree(FWScanIndex** index);
 // Drops the slot of `entry`, if any, keeping the others in order; allocates
-// nothing. Called before the entry is unlinked and freed.
+// nothing. Called before the entry is unlinked and freed. With a
+// classifier, whose leaves name slots by number, the slot stays as a
+// tombstone instead: it never passes and its entry is null.
 void FWScanIndexForget(FWScanIndex* index, const FWRuleEntry* entry);

@@ -258,6 +258,20 @@ inline FWPacketKey PacketKey(const FWScan& s) {
   return k;
 }
 
+// The packet's value on each classifier dimension (fw_classifier.h); 0 for
+// a field the packet lacks.
+inline FWClsKey ClassifierKey(const FWScan& s) {
+  const FWPktSummary* summary = s.summary;
+  const uint32_t presence = s.presence;
+  FWClsKey key;
+  key.v[0] = (presence & FW_WC_IPSA) ? FWNet32(summary->ipSa) : 0;
+  key.v[1] = (presence & FW_WC_IPDA) ? FWNet32(summary->ipDa) : 0;
+  key.v[2] = (presence & FW_WC_SPORT) ? FWNet16(summary->sPort) : 0;
+  key.v[3] = (presence & FW_WC_DPORT) ? FWNet16(summary->dPort) : 0;
+  key.v[4] = (presence & FW_WC_IPPROTO) ? summary->ipProto : 0;
+  return key;
+}
+
 }  // namespace
 
 FWRuleEntry* FWFindRuleForPacket(SLCGenericFilter* filter, ZelPkt* pkt, uint32_t direction,
@@ -288,7 +302,7 @@ FWRuleEntry* FWFindRuleForPacket(SLCGenericFilter* filter, ZelPkt* pkt, uint32_t
                      (s.v4 || s.v6 || (s.presence & (FW_WC_IPSA | FW_WC_IPDA)) == 0);
   if (__builtin_expect(!keyed, 0)) {
     for (uint32_t i = 0; i < count; i++) {
-      if (FWRuleMatches(entries[i]->rule, &s)) return entries[i];
+      if (entries[i] != nullptr && FWRuleMatches(entries[i]->rule, &s)) return entries[i];
     }
     return nullptr;
   }
@@ -302,6 +316,27 @@ FWRuleEntry* FWFindRuleForPacket(SLCGenericFilter* filter, ZelPkt* pkt, uint32_t
   auto accept = [&](uint32_t i) {
     return (slots[i].value[0] & FW_KEY0_EXACT) || FWRuleMatches(entries[i]->rule, &s);
   };
+
+  if (const FWClassifier* cls = index->classifier; cls != nullptr) {
+    // The leaf's candidates and the residual rules, merged in ascending
+    // slot order: the first that passes its slot and test is the first
+    // match of the whole scan.
+    uint32_t leafCount;
+    const uint32_t* leaf = FWClassifierLeaf(cls, ClassifierKey(s), &leafCount);
+    const uint32_t* rest = cls->residual;
+    const uint32_t restCount = cls->numResidual;
+    uint32_t a = 0, b = 0;
+    while (a < leafCount || b < restCount) {
+      uint32_t i;
+      if (b == restCount || (a < leafCount && leaf[a] < rest[b])) {
+        i = leaf[a++];
+      } else {
+        i = rest[b++];
+      }
+      if (miss(slots[i]) == 0 && accept(i)) return entries[i];
+    }
+    return nullptr;
+  }
   // Two slots per iteration and one branch for both while neither passes;
   // a passing pair is resolved in order, so the first match still wins.
   uint32_t i = 0;
