@@ -1,0 +1,321 @@
+// General rules on the whole packet path, with ClassBench-like rulesets and
+// packets from the shared generator (fixed seeds): every frame is parsed,
+// looked up, counted and accepted through SLCGenericProcessPackets.
+//
+//   BM_ClassBench/<rules>        ns_per_pkt over 2^16 packets in lists of 64
+//                                (half inside a random rule, half random)
+//   BM_ClassBenchApply/<rules>   ms to apply the ruleset (classifier built),
+//                                and the classifier's bytes per rule
+//   BM_Mixed/<rules>             rules with negations, masked MACs, 802.1Q
+//                                tags and IPv6 ranges in among ClassBench-
+//                                like ones, same packet mix
+//
+// Before timing, one pass over every packet is checked: the counters of
+// every rule must equal the first-match histogram of the generator's own
+// ordered scan (the run aborts otherwise).
+//
+// --json=<file> is Google Benchmark's --benchmark_out in JSON; the plot
+// script (scripts/bench-plot.sh) reads it.
+
+#include <benchmark/benchmark.h>
+
+#include <cstdio>
+#include <memory>
+#include <vector>
+
+#pragma GCC diagnostic push
+#pragma GCC diagnostic ignored "-Wunused-function"
+#include "classbench_gen.h"
+#pragma GCC diagnostic pop
+#include "agent/agent.h"
+#include "firewall/firewall.h"
+#include "firewall/fw_index.h"
+#include "host/core/host_core.h"
+#include "host/net/packets.h"
+#include "host/sluice/framework.h"
+#include "module/locks.h"
+#include "module/module.h"
+#include "tools/lib/frames.h"
+#include "tools/lib/ruleset_builder.h"
+
+namespace {
+
+constexpr size_t kListLen = 64;
+constexpr size_t kPackets = 1 << 16;
+constexpr const char* kAgent = "sluice-generic-quelmar";
+
+void PutNet32(uint8_t* p, uint32_t v) {
+  p[0] = static_cast<uint8_t>(v >> 24);
+  p[1] = static_cast<uint8_t>(v >> 16);
+  p[2] = static_cast<uint8_t>(v >> 8);
+  p[3] = static_cast<uint8_t>(v);
+}
+
+// The generator's rule as a general rule record: prefixes as ranges (or
+// equality for /32), wildcards for /0, 0-65535 and protocol mask 0.
+FWRule RecordOf(const Rule4& x) {
+  FWRule r;
+  std::memset(&r, 0, sizeof(r));
+  r.action = SLCGenericActionAccept;
+  r.direction = SLCGenericDirectionBidirectional;
+  r.ruleFlags = FW_FLAG_IPV4 | FW_WC_DMAC | FW_WC_SMAC | FW_WC_ETHTYPE | FW_WC_VLAN | FW_WC_RPTAG;
+  auto addr = [&](uint32_t lo, uint32_t hi, uint8_t len, uint32_t wc, uint32_t range,
+                  uint8_t* rlo, uint8_t* rhi) {
+    if (len == 0) {
+      r.ruleFlags |= wc;
+      return;
+    }
+    PutNet32(rlo, lo);
+    if (lo != hi) {
+      r.ruleFlags |= range;
+      PutNet32(rhi, hi);
+    }
+  };
+  addr(x.src_lo, x.src_hi, x.src_len, FW_WC_IPSA, FW_RANGE_IPSA, r.ipSa, r.ipSaHigh);
+  addr(x.dst_lo, x.dst_hi, x.dst_len, FW_WC_IPDA, FW_RANGE_IPDA, r.ipDa, r.ipDaHigh);
+  auto port = [&](uint16_t lo, uint16_t hi, uint32_t wc, uint32_t range, uint8_t* rlo,
+                  uint8_t* rhi) {
+    if (lo == 0 && hi == 65535) {
+      r.ruleFlags |= wc;
+      return;
+    }
+    FWPutNet16(rlo, lo);
+    if (lo != hi) {
+      r.ruleFlags |= range;
+      FWPutNet16(rhi, hi);
+    }
+  };
+  port(x.sp_lo, x.sp_hi, FW_WC_SPORT, FW_RANGE_SPORT, r.sPort, r.sPortHigh);
+  port(x.dp_lo, x.dp_hi, FW_WC_DPORT, FW_RANGE_DPORT, r.dPort, r.dPortHigh);
+  if (x.proto_mask == 0) {
+    r.ruleFlags |= FW_WC_IPPROTO;
+  } else {
+    r.ipProto = x.proto;
+  }
+  return r;
+}
+
+// One rule in four made one no peer classifier expresses: a negated
+// ethertype, a masked source MAC, an 802.1Q tag, or an IPv6 range. The
+// reference match of the packets (all IPv4, untagged, from one MAC) is
+// kept by construction: the negation is of an ethertype no packet has,
+// the MAC mask admits the packets' MAC, and the tag and IPv6 rules match
+// no packet.
+FWRule MixedRecordOf(const Rule4& x, uint32_t i, bool* matchesNothing) {
+  FWRule r = RecordOf(x);
+  *matchesNothing = false;
+  switch (i % 16) {
+    case 3:  // ethertype other than IPv6
+      r.ruleFlags &= ~FW_WC_ETHTYPE;
+      FWPutNet16(r.ethType, 0x86dd);
+      r.negateFlags |= FW_NEG_ETHTYPE;
+      break;
+    case 7: {  // source MAC 02:00:00:xx:xx:xx
+      const uint8_t mac[6] = {2, 0, 0, 0, 0, 1}, mask[6] = {0xff, 0xff, 0xff, 0, 0, 0};
+      r.ruleFlags &= ~FW_WC_SMAC;
+      r.ruleFlags |= FW_MASK_SMAC;
+      std::memcpy(r.sMac, mac, 6);
+      std::memcpy(r.sMacMask, mask, 6);
+      break;
+    }
+    case 11:  // a VLAN the packets lack
+      r.ruleFlags &= ~FW_WC_VLAN;
+      PutNet32(r.vlan1QTag, 0x81000000u | i);
+      *matchesNothing = true;
+      break;
+    case 15: {  // an IPv6 range
+      r.ruleFlags &= ~(FW_FLAG_IPV4 | FW_WC_IPSA);
+      r.ruleFlags |= FW_RANGE_IPSA;
+      std::memset(r.ipSa, 0, 16);
+      std::memset(r.ipSaHigh, 0, 16);
+      r.ipSa[0] = 0x20, r.ipSa[1] = 0x01, r.ipSa[4] = static_cast<uint8_t>(i >> 8);
+      r.ipSaHigh[0] = 0x20, r.ipSaHigh[1] = 0x01, r.ipSaHigh[4] = static_cast<uint8_t>(i >> 8);
+      r.ipSaHigh[5] = 0xff;
+      if (!(r.ruleFlags & FW_WC_IPDA)) {  // both addresses must be IPv6
+        r.ruleFlags |= FW_WC_IPDA;
+        r.ruleFlags &= ~FW_RANGE_IPDA;
+      }
+      *matchesNothing = true;
+      break;
+    }
+    default: break;
+  }
+  return r;
+}
+
+class Bench {
+ public:
+  Bench(uint32_t n, bool mixed) : n_(n), mixed_(mixed) {
+    host::Reset();
+    host::Timers::SetMode(host::TimerMode::Manual);
+    if (host::Loader::Load(&slcGenericModuleImage, {{"SLCGENERIC_HEAP_MAX_SIZE", INT32_MAX}}) !=
+            0 ||
+        host::Sluice::CreateFilter(kAgent, host::FilterConfig{}, &id_) != ZEL_OK) {
+      std::fprintf(stderr, "module or filter failed\n");
+      std::abort();
+    }
+    priv_ = host::Sluice::FilterPriv(id_);
+    rules_ = gen_rules(static_cast<int>(n), 0x5eed0000ull + n);
+    std::vector<Key> keys = gen_packets(rules_, kPackets, 0xfeed0000ull + n);
+
+    rules::RulesetBuilder builder(8);
+    std::vector<Rule4> reference;  // the rules a packet can match, in order
+    std::vector<uint32_t> position;  // their record numbers
+    for (uint32_t i = 0; i < n; i++) {
+      bool nothing = false;
+      builder.Add(mixed ? MixedRecordOf(rules_[i], i, &nothing) : RecordOf(rules_[i]));
+      if (!nothing) {
+        reference.push_back(rules_[i]);
+        position.push_back(i);
+      }
+    }
+    ruleset_ = builder.Bytes();
+    applyMs_ = Apply();
+
+    for (size_t p = 0; p < kPackets; p += kListLen) {
+      auto list = std::make_unique<host::PacketList>();
+      for (size_t k = 0; k < kListLen; k++) list->Append(host::Packets::Make(Frame(keys[p + k])));
+      lists_.push_back(std::move(list));
+    }
+
+    // One checked pass: per-rule counters against the ordered scan.
+    for (size_t l = 0; l < lists_.size(); l++) RunOne();
+    std::vector<uint64_t> want(n, 0);
+    const size_t checked = n >= 100000 ? kPackets / 8 : kPackets;
+    for (size_t p = 0; p < checked; p++) {
+      const int m = scan_naive(reference.data(), static_cast<int>(reference.size()), keys[p]);
+      if (m >= 0) want[position[static_cast<size_t>(m)]]++;
+    }
+    if (checked == kPackets) {
+      const auto general = Entries();
+      for (uint32_t i = 0; i < n; i++) {
+        if (general[i]->rule.pktCount != want[i]) {
+          std::fprintf(stderr, "rule %u counted %llu packets, the reference %llu\n", i,
+                       static_cast<unsigned long long>(general[i]->rule.pktCount),
+                       static_cast<unsigned long long>(want[i]));
+          std::abort();
+        }
+      }
+    }
+  }
+
+  ~Bench() {
+    lists_.clear();
+    host::Loader::Unload();
+    host::Reset();
+  }
+
+  bool Is(uint32_t n, bool mixed) const { return n_ == n && mixed_ == mixed; }
+
+  void RunOne() {
+    host::PacketList& list = *lists_[next_];
+    if (++next_ == lists_.size()) next_ = 0;
+    ZelStatus st = SLCGenericProcessPackets(priv_, list.get(), 1);
+    benchmark::DoNotOptimize(st);
+  }
+
+  // Replaces the ruleset with itself; milliseconds.
+  double Apply() {
+    std::vector<uint8_t> copy(ruleset_);
+    auto* filter = static_cast<SLCGenericFilter*>(priv_);
+    SLCGenericWriteGuard guard(FWContext(filter)->configLock);
+    const double t0 = now_ns();
+    if (FWApplyRuleset(filter, reinterpret_cast<FWRuleset*>(copy.data()), 1, 1) != ZEL_OK) {
+      std::fprintf(stderr, "ruleset not applied\n");
+      std::abort();
+    }
+    return (now_ns() - t0) / 1e6;
+  }
+
+  double ClassifierBytes() const {
+    const FWScanIndex* index = FWContext(static_cast<SLCGenericFilter*>(priv_))->scanIndex;
+    return index && index->classifier ? index->classifier->bytes : 0;
+  }
+  double ResidualRules() const {
+    const FWScanIndex* index = FWContext(static_cast<SLCGenericFilter*>(priv_))->scanIndex;
+    return index && index->classifier ? index->classifier->numResidual : 0;
+  }
+  double applyMs_ = 0;
+
+ private:
+  std::vector<FWRuleEntry*> Entries() {
+    std::vector<FWRuleEntry*> v;
+    FWFilterContext* ctx = FWContext(static_cast<SLCGenericFilter*>(priv_));
+    for (ListLinks* l = ctx->ruleList.prev; l != &ctx->ruleList; l = l->prev) {
+      v.push_back(LIST_CONTAINER(l, FWRuleEntry, link));
+    }
+    return v;
+  }
+
+  static frames::Bytes Frame(const Key& k) {
+    frames::FrameBuilder b;
+    b.Eth(frames::Mac("02:00:00:00:00:02"), frames::Mac("02:00:00:00:00:01"));
+    frames::Ip4Addr sa, da;
+    PutNet32(sa.data(), k.src);
+    PutNet32(da.data(), k.dst);
+    b.Ipv4(sa, da);
+    if (k.proto == 17) {
+      b.Udp(k.sport, k.dport);
+    } else {
+      b.Tcp(k.sport, k.dport);
+    }
+    return b.Payload(6).Build();
+  }
+
+  uint32_t n_;
+  bool mixed_;
+  host::FilterId id_ = 0;
+  void* priv_ = nullptr;
+  std::vector<Rule4> rules_;
+  std::vector<uint8_t> ruleset_;
+  std::vector<std::unique_ptr<host::PacketList>> lists_;
+  size_t next_ = 0;
+};
+
+std::unique_ptr<Bench> current;
+
+Bench& Use(uint32_t n, bool mixed) {
+  if (!current || !current->Is(n, mixed)) {
+    current.reset();
+    current = std::make_unique<Bench>(n, mixed);
+  }
+  return *current;
+}
+
+void Timed(benchmark::State& state, bool mixed) {
+  Bench& b = Use(static_cast<uint32_t>(state.range(0)), mixed);
+  for (auto _ : state) b.RunOne();
+  const double items = static_cast<double>(state.iterations()) * kListLen;
+  state.SetItemsProcessed(static_cast<int64_t>(items));
+  state.counters["ns_per_pkt"] =
+      benchmark::Counter(items, benchmark::Counter::kIsRate | benchmark::Counter::kInvert);
+  state.counters["rules"] = static_cast<double>(state.range(0));
+  state.counters["residual"] = b.ResidualRules();
+}
+
+void BM_ClassBench(benchmark::State& state) { Timed(state, false); }
+BENCHMARK(BM_ClassBench)->Arg(100)->Arg(1000)->Arg(10000)->Arg(100000);
+
+void BM_Mixed(benchmark::State& state) { Timed(state, true); }
+BENCHMARK(BM_Mixed)->Arg(1000)->Arg(10000);
+
+void BM_ClassBenchApply(benchmark::State& state) {
+  Bench& b = Use(static_cast<uint32_t>(state.range(0)), false);
+  double total = 0;
+  for (auto _ : state) total += b.Apply();
+  state.counters["apply_ms"] = total / static_cast<double>(state.iterations());
+  state.counters["classifier_bytes_per_rule"] =
+      b.ClassifierBytes() / static_cast<double>(state.range(0));
+}
+BENCHMARK(BM_ClassBenchApply)->Arg(10000)->Arg(100000)->Iterations(3)->Unit(benchmark::kMillisecond);
+
+}  // namespace
+
+int main(int argc, char** argv) {
+  benchmark::Initialize(&argc, argv);
+  if (benchmark::ReportUnrecognizedArguments(argc, argv)) return 1;
+  benchmark::RunSpecifiedBenchmarks();
+  benchmark::Shutdown();
+  current.reset();
+  return 0;
+}
