@@ -235,6 +235,17 @@ class Bench {
     const FWScanIndex* index = FWContext(static_cast<SLCGenericFilter*>(priv_))->scanIndex;
     return index && index->classifier ? index->classifier->numResidual : 0;
   }
+  // The longest leaf of the classifier.
+  double LongestLeaf() const {
+    const FWScanIndex* index = FWContext(static_cast<SLCGenericFilter*>(priv_))->scanIndex;
+    if (!index || !index->classifier) return 0;
+    uint32_t most = 0;
+    const FWClassifier* c = index->classifier;
+    for (uint32_t i = 0; i < c->numNodes; i++) {
+      if (c->nodes[i].dim == FW_CLS_LEAF && c->nodes[i].count > most) most = c->nodes[i].count;
+    }
+    return most;
+  }
   double applyMs_ = 0;
 
  private:
@@ -291,6 +302,7 @@ void Timed(benchmark::State& state, bool mixed) {
       benchmark::Counter(items, benchmark::Counter::kIsRate | benchmark::Counter::kInvert);
   state.counters["rules"] = static_cast<double>(state.range(0));
   state.counters["residual"] = b.ResidualRules();
+  state.counters["longest_leaf"] = b.LongestLeaf();
 }
 
 void BM_ClassBench(benchmark::State& state) { Timed(state, false); }

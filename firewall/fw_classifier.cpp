@@ -16,8 +16,8 @@ constexpr uint32_t kMaxCutBits = 8;
 // A node may copy its rules into its children at most this many times over
 // (children counted too), so that one cut never multiplies memory.
 constexpr uint64_t kSpaceFactor = 4;
-// Nodes per rule, beyond one full cut.
-constexpr uint64_t kNodesPerRule = 16;
+// A node costs three leaf entries (12 bytes against 4).
+constexpr uint64_t kNodeCost = sizeof(FWClsNode) / sizeof(uint32_t);
 
 // A rule's projection: inclusive intervals, numeric order.
 struct Box {
@@ -128,14 +128,22 @@ void Project(const FWRule& r, Box* b) {
   if (compared(FW_WC_IPPROTO, FW_NEG_IPPROTO)) Interval(b, 4, r.ipProto, r.ipProto);
 }
 
-// Wide on every dimension: the rule would be copied into most leaves.
-bool IsResidual(const Box& b) {
+// The tree a rule goes to, or FW_CLS_TREES for the residual list. Widths
+// are compared as fractions of their dimension.
+uint32_t TreeOf(const Box& b) {
+  uint64_t width[FW_CLS_DIMS];
   for (uint32_t d = 0; d < FW_CLS_DIMS; d++) {
-    if (static_cast<uint64_t>(b.hi[d]) - b.lo[d] < (uint64_t{1} << (kDimBits[d] - 4))) {
-      return false;
-    }
+    width[d] = (static_cast<uint64_t>(b.hi[d]) - b.lo[d]) << (32 - kDimBits[d]);
   }
-  return true;
+  constexpr uint64_t kLongPrefix = uint64_t{1} << 16;  // a /16 or longer
+  constexpr uint64_t kNarrow = uint64_t{1} << 28;      // a sixteenth or less
+  const uint32_t addr = width[1] < width[0] ? 1 : 0;
+  const uint32_t port = width[3] < width[2] ? 3 : 2;
+  if (width[addr] < kLongPrefix) return addr;
+  if (width[port] < kNarrow) return port;
+  if (width[addr] < kNarrow) return addr;
+  if (width[4] < kNarrow) return 4;
+  return FW_CLS_TREES;
 }
 
 struct Builder {
@@ -144,8 +152,6 @@ struct Builder {
   HeapArray<uint32_t> leaves;
   HeapArray<uint32_t> scratch;  // rule lists of the nodes being built, as a stack
   HeapArray<uint32_t> counts;   // per child, 2^kMaxCutBits + 1
-  uint64_t leafBudget;
-  uint64_t nodeBudget;
   bool failed = false;
 
   [[nodiscard]] bool MakeLeaf(uint32_t node, uint32_t off, uint32_t count) {
@@ -204,11 +210,15 @@ struct Builder {
   }
 
   // Builds node `node` for the rules scratch[off, off + count) in region
-  // `reg`. False when memory ran out.
+  // `reg`, spending at most `budget` leaf entries (nodes at kNodeCost) on
+  // the subtree; at least `count`, what a leaf takes. A cut keeps enough
+  // for every child to be a leaf and shares the rest in proportion to the
+  // children's rules, so the bound holds however the tree grows. False
+  // when memory ran out.
   [[nodiscard]] bool Build(uint32_t node, uint32_t off, uint32_t count, const Region& reg,
-                           uint32_t depth) {
+                           uint32_t depth, uint64_t budget) {
     const FWClassifierTuning& t = g_fwClassifierTuning;
-    if (count <= t.leafSize || depth >= t.maxDepth || leaves.size > leafBudget) {
+    if (count <= t.leafSize || depth >= t.maxDepth) {
       return MakeLeaf(node, off, count);
     }
     // The cut that leaves the smallest largest child within the space
@@ -232,9 +242,10 @@ struct Builder {
       }
     }
     const uint32_t children = 1u << bestBits;
-    if (bestDim == FW_CLS_DIMS || uint64_t{nodes.size} + children > nodeBudget) {
+    if (bestDim == FW_CLS_DIMS || children * kNodeCost + bestCopies > budget) {
       return MakeLeaf(node, off, count);
     }
+    const uint64_t share = budget - children * kNodeCost;
 
     if (!nodes.Reserve(uint64_t{nodes.size} + children)) return false;
     const uint32_t childBase = nodes.size;
@@ -273,7 +284,12 @@ struct Builder {
         scratch.size = curOff;
         continue;
       }
-      if (!Build(childBase + c, curOff, curCount, sub, depth + 1)) return false;
+      const uint64_t childBudget =
+          bestCopies == 0 ? 0 : share * curCount / bestCopies;
+      if (!Build(childBase + c, curOff, curCount, sub, depth + 1,
+                 childBudget > curCount ? childBudget : curCount)) {
+        return false;
+      }
       if (havePrev) {
         // Drop the previous list; the current one becomes previous.
         // Forward copy to a lower address: safe although the lists may overlap.
@@ -308,21 +324,41 @@ ZelStatus FWClassifierBuild(FWRuleEntry* const* entries, uint32_t count,
   {
     Builder b;
     b.boxes = boxes;
-    b.leafBudget = uint64_t{count} * g_fwClassifierTuning.budgetPerRule;
-    b.nodeBudget = uint64_t{count} * kNodesPerRule + (1u << kMaxCutBits) + 1;
     HeapArray<uint32_t> residual;
-    bool ok = b.counts.Reserve((1u << kMaxCutBits) + 1) && b.scratch.Reserve(count) &&
-              b.nodes.Push(FWClsNode{});
+    auto* tree = static_cast<uint8_t*>(SLCGenericAlloc(count));
+    bool ok = tree != nullptr && b.counts.Reserve((1u << kMaxCutBits) + 1) &&
+              b.scratch.Reserve(count);
+    uint32_t members[FW_CLS_TREES] = {};
     for (uint32_t i = 0; ok && i < count; i++) {
       Project(entries[i]->rule, &boxes[i]);
-      ok = IsResidual(boxes[i]) ? residual.Push(i) : b.scratch.Push(i);
+      tree[i] = static_cast<uint8_t>(TreeOf(boxes[i]));
+      if (tree[i] == FW_CLS_TREES) {
+        ok = residual.Push(i);
+      } else {
+        members[tree[i]]++;
+      }
     }
     Region root;
     for (uint32_t d = 0; d < FW_CLS_DIMS; d++) {
       root.base[d] = 0;
       root.width[d] = static_cast<uint8_t>(kDimBits[d]);
     }
-    if (ok) ok = b.Build(0, 0, b.scratch.size, root, 0);
+    uint32_t roots[FW_CLS_TREES];
+    for (uint32_t t = 0; t < FW_CLS_TREES; t++) {
+      roots[t] = FW_CLS_NO_TREE;
+      if (!ok || members[t] == 0) continue;
+      b.scratch.size = 0;
+      for (uint32_t i = 0; i < count; i++) {
+        if (tree[i] == t) b.scratch.data[b.scratch.size++] = i;
+      }
+      // Each tree's share of the bound is that of its rules.
+      const uint64_t budget = uint64_t{members[t]} * g_fwClassifierTuning.budgetPerRule;
+      roots[t] = b.nodes.size;
+      ok = b.nodes.Push(FWClsNode{}) &&
+           b.Build(roots[t], 0, b.scratch.size, root, 0,
+                   budget > members[t] ? budget : members[t]);
+    }
+    if (tree != nullptr) SLCGenericFree(tree);
 
     if (ok) {
       const uint64_t bytes = sizeof(FWClassifier) + uint64_t{b.nodes.size} * sizeof(FWClsNode) +
@@ -340,6 +376,7 @@ ZelStatus FWClassifierBuild(FWRuleEntry* const* entries, uint32_t count,
         if (residual.size != 0) {
           zel_Memcpy(rest, residual.data, static_cast<size_t>(residual.size) * 4);
         }
+        for (uint32_t t = 0; t < FW_CLS_TREES; t++) c->roots[t] = roots[t];
         c->numNodes = b.nodes.size;
         c->numLeafSlots = b.leaves.size;
         c->numResidual = residual.size;

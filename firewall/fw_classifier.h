@@ -1,7 +1,7 @@
-// The compiled classifier of the general rules: a decision tree over five
-// numeric fields that narrows the scan index (fw_index.h) to a few
-// candidate slots per packet, plus a residual list of the rules the tree
-// cannot separate.
+// The compiled classifier of the general rules: decision trees over five
+// numeric fields that narrow the scan index (fw_index.h) to a few
+// candidate slots per packet, plus a residual list of the rules no tree
+// can separate.
 //
 // The ordered scan stays the definition. The tree only ever leaves out
 // slots that would miss: each rule is projected on five dimensions, every
@@ -18,18 +18,23 @@
 // it: every rule comparing the field requires its presence and misses
 // anyway, and every other rule spans the whole dimension.
 //
-// A node cuts an aligned power-of-two block of one dimension into 2^bits
-// equal children; a rule goes to every child its projection meets, in
-// ruleset order, so a leaf lists slot numbers in ascending order. Rules
-// that are wide on every dimension would be copied into most leaves: they
-// form the residual list instead, also ascending. A lookup walks both
-// lists merged, tests each slot (and the full test when the slot says so)
-// and stops at the first match: the same rule as the ordered scan.
+// Each rule goes to the tree of the dimension that separates it best (a
+// long address prefix, else a port, else a shorter address, else the
+// protocol), so that rules wide on one address do not get copied across
+// every cut of a tree built on it. A node cuts an aligned power-of-two
+// block of one dimension into 2^bits equal children; a rule goes to every
+// child its projection meets, in ruleset order, so a leaf lists slot
+// numbers in ascending order. Rules wide on every dimension would be
+// copied into most leaves: they form the residual list instead, also
+// ascending. A lookup merges the leaf of every tree and the residual list
+// in ascending order, tests each slot (and the full test when the slot
+// says so) and stops at the first match: the same rule, with the same
+// tests run in the same order up to it, as the ordered scan.
 //
 // Memory comes from the module heap and is bounded per rule: when the
 // bound would be passed, nodes stop being cut and their leaves just get
-// longer. Nothing is kept of the build but three blocks: header with
-// nodes, leaf lists, residual list (one allocation).
+// longer. The build keeps one block: header, nodes, leaf lists, residual
+// list.
 #pragma once
 
 #include "firewall/fw_rules.h"
@@ -46,8 +51,12 @@ struct FWClsNode {
 static_assert(sizeof(FWClsNode) == 12);
 inline constexpr uint8_t FW_CLS_LEAF = 0xff;
 
+inline constexpr uint32_t FW_CLS_TREES = FW_CLS_DIMS;
+inline constexpr uint32_t FW_CLS_NO_TREE = 0xffffffffu;
+
 struct FWClassifier {
-  uint32_t numNodes;       // nodes[0] is the root
+  uint32_t roots[FW_CLS_TREES];  // node number of each tree's root, or FW_CLS_NO_TREE
+  uint32_t numNodes;
   uint32_t numLeafSlots;
   uint32_t numResidual;
   uint32_t bytes;          // the whole block, for accounting
@@ -58,8 +67,8 @@ struct FWClassifier {
 
 // Build limits. Rulesets smaller than minRules are scanned in order; a
 // node with at most leafSize rules is a leaf; the tree holds at most
-// budgetPerRule leaf slot numbers per rule. Tests lower them to exercise
-// deep trees on small rulesets.
+// budgetPerRule 4-byte words (leaf entries; a node takes three) per rule.
+// Tests lower them to exercise deep trees on small rulesets.
 struct FWClassifierTuning {
   uint32_t minRules;
   uint32_t leafSize;
@@ -67,7 +76,7 @@ struct FWClassifierTuning {
   uint32_t budgetPerRule;
 };
 extern FWClassifierTuning g_fwClassifierTuning;
-inline constexpr FWClassifierTuning kFWClassifierDefaults = {24, 8, 24, 64};
+inline constexpr FWClassifierTuning kFWClassifierDefaults = {24, 16, 24, 256};
 
 struct FWScanSlot;
 struct FWRuleEntry;
@@ -84,11 +93,12 @@ struct FWClsKey {
   uint32_t v[FW_CLS_DIMS];
 };
 
-// The leaf of `key`: its first slot number and count.
-inline const uint32_t* FWClassifierLeaf(const FWClassifier* c, const FWClsKey& key,
-                                        uint32_t* count) {
+// The leaf of `key` in the tree rooted at node `root`: its first slot
+// number and count.
+inline const uint32_t* FWClassifierLeaf(const FWClassifier* c, uint32_t root,
+                                        const FWClsKey& key, uint32_t* count) {
   const FWClsNode* nodes = c->nodes;
-  const FWClsNode* n = nodes;
+  const FWClsNode* n = nodes + root;
   while (n->dim != FW_CLS_LEAF) {
     n = &nodes[n->base + ((key.v[n->dim] >> n->shift) & n->mask)];
   }

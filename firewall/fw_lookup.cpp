@@ -318,25 +318,41 @@ FWRuleEntry* FWFindRuleForPacket(SLCGenericFilter* filter, ZelPkt* pkt, uint32_t
   };
 
   if (const FWClassifier* cls = index->classifier; cls != nullptr) {
-    // The leaf's candidates and the residual rules, merged in ascending
-    // slot order: the first that passes its slot and test is the first
-    // match of the whole scan.
-    uint32_t leafCount;
-    const uint32_t* leaf = FWClassifierLeaf(cls, ClassifierKey(s), &leafCount);
-    const uint32_t* rest = cls->residual;
-    const uint32_t restCount = cls->numResidual;
-    uint32_t a = 0, b = 0;
-    while (a < leafCount || b < restCount) {
-      uint32_t i;
-      if (b == restCount || (a < leafCount && leaf[a] < rest[b])) {
-        i = leaf[a++];
-      } else {
-        i = rest[b++];
+    // The leaf of every tree and the residual list, merged in ascending
+    // slot order: the first slot that passes its test is the first match
+    // of the whole scan, reached through the same full tests.
+    const FWClsKey key = ClassifierKey(s);
+    const uint32_t* list[FW_CLS_TREES + 1];
+    const uint32_t* end[FW_CLS_TREES + 1];
+    uint32_t lists = 0;
+    for (uint32_t t = 0; t < FW_CLS_TREES; t++) {
+      if (cls->roots[t] == FW_CLS_NO_TREE) continue;
+      uint32_t n;
+      const uint32_t* leaf = FWClassifierLeaf(cls, cls->roots[t], key, &n);
+      if (n == 0) continue;
+      list[lists] = leaf;
+      end[lists++] = leaf + n;
+    }
+    if (cls->numResidual != 0) {
+      list[lists] = cls->residual;
+      end[lists++] = cls->residual + cls->numResidual;
+    }
+    while (lists != 0) {
+      uint32_t best = 0;
+      for (uint32_t j = 1; j < lists; j++) {
+        if (*list[j] < *list[best]) best = j;
+      }
+      const uint32_t i = *list[best]++;
+      if (list[best] == end[best]) {  // exhausted: the last list takes its place
+        lists--;
+        list[best] = list[lists];
+        end[best] = end[lists];
       }
       if (miss(slots[i]) == 0 && accept(i)) return entries[i];
     }
     return nullptr;
   }
+
   // Two slots per iteration and one branch for both while neither passes;
   // a passing pair is resolved in order, so the first match still wins.
   uint32_t i = 0;
