@@ -14,13 +14,22 @@
 // every rule must equal the first-match histogram of the generator's own
 // ordered scan (the run aborts otherwise).
 //
-// --json=<file> is Google Benchmark's --benchmark_out in JSON; the plot
-// script (scripts/bench-plot.sh) reads it.
+// With libdpdk (an optional dependency of this benchmark only), the peer
+// classifier runs on the same rules and packets, scalar and with the best
+// method this processor offers, registered right after the project's run
+// of the same size so that the runs interleave:
+//   BM_PeerAclScalar/<rules>, BM_PeerAclBest/<rules>   ns_per_pkt over
+//                                bursts of 64 prepared 5-tuples
+// Its first match is checked against the ordered scan for every packet.
+//
+// JSON for the plot script: --benchmark_out=<file> --benchmark_out_format=json
+// (scripts/bench-plot.sh runs it and draws the figure).
 
 #include <benchmark/benchmark.h>
 
 #include <cstdio>
 #include <memory>
+#include <string>
 #include <vector>
 
 #pragma GCC diagnostic push
@@ -37,6 +46,11 @@
 #include "module/module.h"
 #include "tools/lib/frames.h"
 #include "tools/lib/ruleset_builder.h"
+
+#ifdef SLC_HAVE_DPDK
+#include <rte_acl.h>
+#include <rte_eal.h>
+#endif
 
 namespace {
 
@@ -306,7 +320,7 @@ void Timed(benchmark::State& state, bool mixed) {
 }
 
 void BM_ClassBench(benchmark::State& state) { Timed(state, false); }
-BENCHMARK(BM_ClassBench)->Arg(100)->Arg(1000)->Arg(10000)->Arg(100000);
+// Registered in main, size by size, with the peer's runs of each size.
 
 void BM_Mixed(benchmark::State& state) { Timed(state, true); }
 BENCHMARK(BM_Mixed)->Arg(1000)->Arg(10000);
@@ -321,13 +335,182 @@ void BM_ClassBenchApply(benchmark::State& state) {
 }
 BENCHMARK(BM_ClassBenchApply)->Arg(10000)->Arg(100000)->Iterations(3)->Unit(benchmark::kMillisecond);
 
+#ifdef SLC_HAVE_DPDK
+// The peer classifier on the generator's rules: five fields (protocol as a
+// bitmask, addresses as prefixes, ports as ranges), higher priority for
+// earlier rules, packets as the generator's network-order keys.
+RTE_ACL_RULE_DEF(PeerRule, 5);
+
+class Peer {
+ public:
+  explicit Peer(uint32_t n) : n_(n) {
+    const std::vector<Rule4> rules = gen_rules(static_cast<int>(n), 0x5eed0000ull + n);
+    const std::vector<Key> keys = gen_packets(rules, kPackets, 0xfeed0000ull + n);
+    char name[RTE_ACL_NAMESIZE];
+    std::snprintf(name, sizeof(name), "cb%u", n);
+    rte_acl_param param{};
+    param.name = name;
+    param.socket_id = SOCKET_ID_ANY;
+    param.rule_size = RTE_ACL_RULE_SZ(5);
+    param.max_rule_num = n;
+    ctx_ = rte_acl_create(&param);
+    if (ctx_ == nullptr) Die("rte_acl_create");
+    std::vector<PeerRule> acl(n);
+    for (uint32_t i = 0; i < n; i++) {
+      const Rule4& x = rules[i];
+      PeerRule& r = acl[i];
+      std::memset(&r, 0, sizeof(r));
+      r.data.category_mask = 1;
+      r.data.priority = RTE_ACL_MAX_PRIORITY - static_cast<int32_t>(i);
+      r.data.userdata = i + 1;
+      r.field[0].value.u8 = x.proto;
+      r.field[0].mask_range.u8 = x.proto_mask;
+      r.field[1].value.u32 = x.src_lo;
+      r.field[1].mask_range.u32 = x.src_len;
+      r.field[2].value.u32 = x.dst_lo;
+      r.field[2].mask_range.u32 = x.dst_len;
+      r.field[3].value.u16 = x.sp_lo;
+      r.field[3].mask_range.u16 = x.sp_hi;
+      r.field[4].value.u16 = x.dp_lo;
+      r.field[4].mask_range.u16 = x.dp_hi;
+    }
+    if (rte_acl_add_rules(ctx_, reinterpret_cast<const rte_acl_rule*>(acl.data()), n) != 0) {
+      Die("rte_acl_add_rules");
+    }
+    rte_acl_config cfg{};
+    cfg.num_categories = 1;
+    cfg.num_fields = 5;
+    const rte_acl_field_def defs[5] = {
+        {RTE_ACL_FIELD_TYPE_BITMASK, 1, 0, 0, offsetof(NKey, proto)},
+        {RTE_ACL_FIELD_TYPE_MASK, 4, 1, 1, offsetof(NKey, src)},
+        {RTE_ACL_FIELD_TYPE_MASK, 4, 2, 2, offsetof(NKey, dst)},
+        {RTE_ACL_FIELD_TYPE_RANGE, 2, 3, 3, offsetof(NKey, sport)},
+        {RTE_ACL_FIELD_TYPE_RANGE, 2, 4, 3, offsetof(NKey, dport)},
+    };
+    std::memcpy(cfg.defs, defs, sizeof(defs));
+    const double t0 = now_ns();
+    if (rte_acl_build(ctx_, &cfg) != 0) Die("rte_acl_build");
+    buildMs_ = (now_ns() - t0) / 1e6;
+
+    keys_.resize(kPackets);
+    data_.resize(kPackets);
+    want_.resize(kPackets);
+    for (size_t p = 0; p < kPackets; p++) {
+      NKey& k = keys_[p];
+      std::memset(&k, 0, sizeof(k));
+      k.proto = keys[p].proto;
+      k.src = __builtin_bswap32(keys[p].src);
+      k.dst = __builtin_bswap32(keys[p].dst);
+      k.sport = __builtin_bswap16(keys[p].sport);
+      k.dport = __builtin_bswap16(keys[p].dport);
+      data_[p] = reinterpret_cast<const uint8_t*>(&k);
+      want_[p] = static_cast<uint32_t>(scan_naive(rules.data(), static_cast<int>(n), keys[p]) + 1);
+    }
+  }
+  ~Peer() { rte_acl_free(ctx_); }
+
+  bool Is(uint32_t n) const { return n_ == n; }
+
+  // Every packet classified by `method` gets the ordered scan's rule.
+  bool Use(enum rte_acl_classify_alg method) {
+    if (rte_acl_set_ctx_classify(ctx_, method) != 0) return false;
+    std::vector<uint32_t> got(kPackets);
+    if (rte_acl_classify(ctx_, data_.data(), got.data(), kPackets, 1) != 0) Die("classify");
+    for (size_t p = 0; p < kPackets; p++) {
+      if (got[p] != want_[p]) {
+        std::fprintf(stderr, "peer: packet %zu got rule %u, the ordered scan %u\n", p, got[p],
+                     want_[p]);
+        std::abort();
+      }
+    }
+    return true;
+  }
+
+  void RunOne() {
+    rte_acl_classify(ctx_, data_.data() + next_, results_, kListLen, 1);
+    benchmark::DoNotOptimize(results_[0]);
+    next_ += kListLen;
+    if (next_ == kPackets) next_ = 0;
+  }
+
+  double buildMs_ = 0;
+
+ private:
+  [[noreturn]] static void Die(const char* what) {
+    std::fprintf(stderr, "peer classifier: %s failed\n", what);
+    std::abort();
+  }
+
+  uint32_t n_;
+  rte_acl_ctx* ctx_ = nullptr;
+  std::vector<NKey> keys_;
+  std::vector<const uint8_t*> data_;
+  std::vector<uint32_t> want_;
+  uint32_t results_[kListLen];
+  size_t next_ = 0;
+};
+
+std::unique_ptr<Peer> peer;
+
+void PeerTimed(benchmark::State& state, enum rte_acl_classify_alg method) {
+  const uint32_t n = static_cast<uint32_t>(state.range(0));
+  if (!peer || !peer->Is(n)) {
+    peer.reset();
+    peer = std::make_unique<Peer>(n);
+  }
+  if (!peer->Use(method)) {
+    state.SkipWithError("method not available");
+    return;
+  }
+  for (auto _ : state) peer->RunOne();
+  const double items = static_cast<double>(state.iterations()) * kListLen;
+  state.SetItemsProcessed(static_cast<int64_t>(items));
+  state.counters["ns_per_pkt"] =
+      benchmark::Counter(items, benchmark::Counter::kIsRate | benchmark::Counter::kInvert);
+  state.counters["rules"] = static_cast<double>(n);
+  state.counters["build_ms"] = peer->buildMs_;
+}
+
+void BM_PeerAclScalar(benchmark::State& state) { PeerTimed(state, RTE_ACL_CLASSIFY_SCALAR); }
+void BM_PeerAclBest(benchmark::State& state) { PeerTimed(state, RTE_ACL_CLASSIFY_DEFAULT); }
+
+bool InitPeer(const char* argv0) {
+  const char* args[] = {argv0, "--no-huge", "--no-pci", "--no-shconf", "-m", "1024", "-l", "0",
+                        "--log-level=3"};
+  int argc = static_cast<int>(sizeof(args) / sizeof(args[0]));
+  if (rte_eal_init(argc, const_cast<char**>(args)) < 0) {
+    std::fprintf(stderr, "peer classifier skipped: its environment did not initialise\n");
+    return false;
+  }
+  return true;
+}
+#endif
+
 }  // namespace
 
 int main(int argc, char** argv) {
   benchmark::Initialize(&argc, argv);
   if (benchmark::ReportUnrecognizedArguments(argc, argv)) return 1;
+  bool peerReady = false;
+#ifdef SLC_HAVE_DPDK
+  peerReady = InitPeer(argv[0]);
+#endif
+  // Size by size: the project's run, then the peer's runs on the same work.
+  for (int n : {100, 1000, 10000, 100000}) {
+    benchmark::RegisterBenchmark("BM_ClassBench", BM_ClassBench)->Arg(n);
+#ifdef SLC_HAVE_DPDK
+    if (peerReady && n <= 10000) {  // the peer's build of 100,000 rules takes minutes
+      benchmark::RegisterBenchmark("BM_PeerAclScalar", BM_PeerAclScalar)->Arg(n);
+      benchmark::RegisterBenchmark("BM_PeerAclBest", BM_PeerAclBest)->Arg(n);
+    }
+#endif
+  }
+  (void)peerReady;
   benchmark::RunSpecifiedBenchmarks();
   benchmark::Shutdown();
   current.reset();
+#ifdef SLC_HAVE_DPDK
+  peer.reset();
+#endif
   return 0;
 }
