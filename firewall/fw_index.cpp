@@ -42,10 +42,14 @@ struct SlotBuilder {
       Require(1, 0xffffffffull << shift, static_cast<uint64_t>(FWLoad32(lo)) << shift);
       return;
     }
-    exact = false;
     const uint32_t l = FWNet32(lo), h = FWNet32(hi);
-    if (l > h) return;
+    if (l > h) {
+      exact = false;
+      return;
+    }
     const uint32_t prefix = CommonPrefix32(l, h);
+    // A range that is exactly a prefix is exactly its masked equality.
+    if ((l & ~prefix) != 0 || (h | prefix) != 0xffffffffu) exact = false;
     Require(1, static_cast<uint64_t>(__builtin_bswap32(prefix)) << shift,
             static_cast<uint64_t>(__builtin_bswap32(l & prefix)) << shift);
   }
@@ -56,10 +60,13 @@ struct SlotBuilder {
       Require(0, 0xffffull << shift, static_cast<uint64_t>(FWLoad16(lo)) << shift);
       return;
     }
-    exact = false;
     const uint32_t l = FWNet16(lo), h = FWNet16(hi);
-    if (l > h) return;
+    if (l > h) {
+      exact = false;
+      return;
+    }
     const uint32_t prefix = CommonPrefix32(l << 16, h << 16) >> 16;
+    if ((l & ~prefix) != 0 || (h | prefix) != 0xffffu) exact = false;
     Require(0, static_cast<uint64_t>(__builtin_bswap16(static_cast<uint16_t>(prefix))) << shift,
             static_cast<uint64_t>(__builtin_bswap16(static_cast<uint16_t>(l & prefix)))
                 << shift);

@@ -8,9 +8,10 @@
 // every test of the rule that can be expressed that way:
 //   - presence (every field the rule compares), direction, address family;
 //   - MACs (with their masks), ethertype, protocol, IPv4 addresses and
-//     ports compared for equality;
-//   - a necessary condition for the rest: the common leading bits of an
-//     IPv4 or port range, a 16-bit fold of the 802.1Q tag, 32-bit folds of
+//     ports compared for equality, and IPv4 or port ranges that are
+//     exactly a prefix;
+//   - a necessary condition for the rest: the common leading bits of any
+//     other IPv4 or port range, a 16-bit fold of the 802.1Q tag, 32-bit folds of
 //     IPv6 addresses.
 // Negated fields, IPv6 ranges and the resource-pool tag are left out (mask
 // 0). A slot that passes goes through the full step-by-step test of the

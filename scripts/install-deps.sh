@@ -14,6 +14,11 @@ have_pkg libgtest-dev || need+=(libgtest-dev)
 have_pkg libgmock-dev || need+=(libgmock-dev)
 have_pkg libbenchmark-dev || need+=(libbenchmark-dev)
 have_cmd valgrind || need+=(valgrind)
+# The benchmark plot (scripts/bench-plot.sh); the peer classifier the
+# side-by-side benchmark compares with (optional for every other target).
+have_pkg python3-matplotlib || need+=(python3-matplotlib)
+have_pkg pkg-config || need+=(pkg-config)
+have_pkg libdpdk-dev || need+=(libdpdk-dev)
 
 if [ ${#need[@]} -eq 0 ]; then
   exit 0
