@@ -9,6 +9,9 @@
 //   BM_Mixed/<rules>             rules with negations, masked MACs, 802.1Q
 //                                tags and IPv6 ranges in among ClassBench-
 //                                like ones, same packet mix
+//   BM_OrderedScan/<rules>, BM_MixedOrderedScan/<rules>
+//                                the same without the classifier: the
+//                                ordered scan of every rule up to the match
 //
 // Before timing, one pass over every packet is checked: the counters of
 // every rule must equal the first-match histogram of the generator's own
@@ -159,7 +162,7 @@ FWRule MixedRecordOf(const Rule4& x, uint32_t i, bool* matchesNothing) {
 
 class Bench {
  public:
-  Bench(uint32_t n, bool mixed) : n_(n), mixed_(mixed) {
+  Bench(uint32_t n, bool mixed, bool scanOnly) : n_(n), mixed_(mixed), scanOnly_(scanOnly) {
     host::Reset();
     host::Timers::SetMode(host::TimerMode::Manual);
     if (host::Loader::Load(&slcGenericModuleImage, {{"SLCGENERIC_HEAP_MAX_SIZE", INT32_MAX}}) !=
@@ -184,7 +187,9 @@ class Bench {
       }
     }
     ruleset_ = builder.Bytes();
+    if (scanOnly) g_fwClassifierTuning.minRules = UINT32_MAX;
     applyMs_ = Apply();
+    g_fwClassifierTuning = kFWClassifierDefaults;
 
     for (size_t p = 0; p < kPackets; p += kListLen) {
       auto list = std::make_unique<host::PacketList>();
@@ -219,7 +224,9 @@ class Bench {
     host::Reset();
   }
 
-  bool Is(uint32_t n, bool mixed) const { return n_ == n && mixed_ == mixed; }
+  bool Is(uint32_t n, bool mixed, bool scanOnly) const {
+    return n_ == n && mixed_ == mixed && scanOnly_ == scanOnly;
+  }
 
   void RunOne() {
     host::PacketList& list = *lists_[next_];
@@ -289,6 +296,7 @@ class Bench {
 
   uint32_t n_;
   bool mixed_;
+  bool scanOnly_;
   host::FilterId id_ = 0;
   void* priv_ = nullptr;
   std::vector<Rule4> rules_;
@@ -299,16 +307,16 @@ class Bench {
 
 std::unique_ptr<Bench> current;
 
-Bench& Use(uint32_t n, bool mixed) {
-  if (!current || !current->Is(n, mixed)) {
+Bench& Use(uint32_t n, bool mixed, bool scanOnly = false) {
+  if (!current || !current->Is(n, mixed, scanOnly)) {
     current.reset();
-    current = std::make_unique<Bench>(n, mixed);
+    current = std::make_unique<Bench>(n, mixed, scanOnly);
   }
   return *current;
 }
 
-void Timed(benchmark::State& state, bool mixed) {
-  Bench& b = Use(static_cast<uint32_t>(state.range(0)), mixed);
+void Timed(benchmark::State& state, bool mixed, bool scanOnly = false) {
+  Bench& b = Use(static_cast<uint32_t>(state.range(0)), mixed, scanOnly);
   for (auto _ : state) b.RunOne();
   const double items = static_cast<double>(state.iterations()) * kListLen;
   state.SetItemsProcessed(static_cast<int64_t>(items));
@@ -324,6 +332,10 @@ void BM_ClassBench(benchmark::State& state) { Timed(state, false); }
 
 void BM_Mixed(benchmark::State& state) { Timed(state, true); }
 BENCHMARK(BM_Mixed)->Arg(1000)->Arg(10000);
+void BM_MixedOrderedScan(benchmark::State& state) { Timed(state, true, true); }
+BENCHMARK(BM_MixedOrderedScan)->Arg(1000)->Arg(10000);
+void BM_OrderedScan(benchmark::State& state) { Timed(state, false, true); }
+BENCHMARK(BM_OrderedScan)->Arg(1000)->Arg(10000);
 
 void BM_ClassBenchApply(benchmark::State& state) {
   Bench& b = Use(static_cast<uint32_t>(state.range(0)), false);

@@ -15,6 +15,7 @@ import matplotlib.pyplot as plt  # noqa: E402
 SERIES = [
     ("BM_ClassBench", "this project (whole path)", "o-"),
     ("BM_Mixed", "this project, negations/MAC masks/VLAN/IPv6", "s--"),
+    ("BM_OrderedScan", "this project, ordered scan only (before)", "x:"),
     ("BM_PeerAclScalar", "peer classifier, scalar", "^-"),
     ("BM_PeerAclBest", "peer classifier, best vector method", "v-"),
 ]
@@ -57,13 +58,17 @@ def main():
     scalar = table.get("BM_PeerAclScalar", {})
     best = table.get("BM_PeerAclBest", {})
     mixed = table.get("BM_Mixed", {})
-    print("| rules | this project | peer scalar | peer best | ratio to scalar | mixed ruleset |")
-    print("|---|---|---|---|---|---|")
+    scan = table.get("BM_OrderedScan", {})
+    mixedScan = table.get("BM_MixedOrderedScan", {})
+    print("| rules | this project | peer scalar | peer best | ratio to scalar "
+          "| ordered scan only | mixed ruleset | mixed, ordered scan only |")
+    print("|---|---|---|---|---|---|---|---|")
     for n in sorted(ours):
         def cell(t):
             return f"{t[n]:.0f} ns" if n in t else "-"
         ratio = f"{ours[n] / scalar[n]:.2f}x" if n in scalar else "-"
-        print(f"| {n:,} | {cell(ours)} | {cell(scalar)} | {cell(best)} | {ratio} | {cell(mixed)} |")
+        print(f"| {n:,} | {cell(ours)} | {cell(scalar)} | {cell(best)} | {ratio} "
+              f"| {cell(scan)} | {cell(mixed)} | {cell(mixedScan)} |")
 
 
 if __name__ == "__main__":

@@ -15,4 +15,7 @@ if [ -z "$json" ]; then
   build/release/bench/classbench_bench --benchmark_min_time=0.5 \
     --benchmark_out="$json" --benchmark_out_format=json
 fi
-python3 bench/plot.py "$json" "$out/classbench.png"
+# The Debian interpreter, which has the Debian plotting package.
+py=/usr/bin/python3
+[ -x "$py" ] || py=python3
+"$py" bench/plot.py "$json" "$out/classbench.png"
