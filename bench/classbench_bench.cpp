@@ -25,6 +25,14 @@
 //                                bursts of 64 prepared 5-tuples
 // Its first match is checked against the ordered scan for every packet.
 //
+// Exact hits, 2^18 distinct frames (flows drawn at random among the
+// rules, so at 1,000,000 rules frames and entries are cache-cold):
+//   BM_ExactHits/<rules>          the whole path, every packet a hit
+//   BM_PeerHashBulk/<rules>       the peer hash table's bulk lookup of the
+//                                 same 5-tuples (16-byte keys), bursts of 64
+// Both are checked: every rule's counter against its flow's packets, and
+// every peer lookup against its flow.
+//
 // JSON for the plot script: --benchmark_out=<file> --benchmark_out_format=json
 // (scripts/bench-plot.sh runs it and draws the figure).
 
@@ -53,6 +61,8 @@
 #ifdef SLC_HAVE_DPDK
 #include <rte_acl.h>
 #include <rte_eal.h>
+#include <rte_hash.h>
+#include <rte_hash_crc.h>
 #endif
 
 namespace {
@@ -306,10 +316,14 @@ class Bench {
 };
 
 std::unique_ptr<Bench> current;
+class ExactBench;
+// The host is process-wide: one scenario exists at a time.
+void DropExactBench();
 
 Bench& Use(uint32_t n, bool mixed, bool scanOnly = false) {
   if (!current || !current->Is(n, mixed, scanOnly)) {
     current.reset();
+    DropExactBench();
     current = std::make_unique<Bench>(n, mixed, scanOnly);
   }
   return *current;
@@ -346,6 +360,120 @@ void BM_ClassBenchApply(benchmark::State& state) {
       b.ClassifierBytes() / static_cast<double>(state.range(0));
 }
 BENCHMARK(BM_ClassBenchApply)->Arg(10000)->Arg(100000)->Iterations(3)->Unit(benchmark::kMillisecond);
+
+
+// Exact rules: flow i is 10.x.y.z (i) -> 192.168.0.1, TCP 1234 -> 80.
+constexpr size_t kExactFrames = 1 << 18;
+
+Key FlowKey(uint32_t i) {
+  Key k;
+  std::memset(&k, 0, sizeof(k));
+  k.proto = 6;
+  k.src = 0x0a000000u + i;
+  k.dst = 0xc0a80001u;
+  k.sport = 1234;
+  k.dport = 80;
+  return k;
+}
+
+// The flow of frame f.
+uint32_t FlowOfFrame(size_t f, uint32_t n) { return static_cast<uint32_t>(mix64(f + 1) % n); }
+
+class ExactBench {
+ public:
+  explicit ExactBench(uint32_t n) : n_(n) {
+    host::Reset();
+    host::Timers::SetMode(host::TimerMode::Manual);
+    if (host::Loader::Load(&slcGenericModuleImage, {{"SLCGENERIC_HEAP_MAX_SIZE", INT32_MAX}}) !=
+            0 ||
+        host::Sluice::CreateFilter(kAgent, host::FilterConfig{}, &id_) != ZEL_OK) {
+      std::fprintf(stderr, "module or filter failed\n");
+      std::abort();
+    }
+    priv_ = host::Sluice::FilterPriv(id_);
+    FWRule rule = rules::ParseRule(
+        "action=accept dmac=02:00:00:00:00:02 smac=02:00:00:00:00:01 ethtype=0x0800 "
+        "vlan=none sa=10.0.0.0 da=192.168.0.1 proto=tcp sport=1234 dport=80");
+    rules::RulesetBuilder builder(8);
+    for (uint32_t i = 0; i < n; i++) {
+      PutNet32(rule.ipSa, FlowKey(i).src);
+      builder.Add(rule);
+    }
+    std::vector<uint8_t> bytes = builder.Bytes();
+    auto* filter = static_cast<SLCGenericFilter*>(priv_);
+    {
+      SLCGenericWriteGuard guard(FWContext(filter)->configLock);
+      if (FWApplyRuleset(filter, reinterpret_cast<FWRuleset*>(bytes.data()), 1, 1) != ZEL_OK) {
+        std::fprintf(stderr, "ruleset not applied\n");
+        std::abort();
+      }
+    }
+    for (size_t f = 0; f < kExactFrames; f += kListLen) {
+      auto list = std::make_unique<host::PacketList>();
+      for (size_t k = 0; k < kListLen; k++) {
+        const uint32_t flow = FlowOfFrame(f + k, n);
+        frames::FrameBuilder b;
+        b.Eth(frames::Mac("02:00:00:00:00:02"), frames::Mac("02:00:00:00:00:01"));
+        frames::Ip4Addr sa, da;
+        PutNet32(sa.data(), FlowKey(flow).src);
+        PutNet32(da.data(), FlowKey(flow).dst);
+        list->Append(host::Packets::Make(b.Ipv4(sa, da).Tcp(1234, 80).Payload(6).Build()));
+      }
+      lists_.push_back(std::move(list));
+    }
+    for (size_t l = 0; l < lists_.size(); l++) RunOne();
+    FWFilterContext* ctx = FWContext(filter);
+    // Every packet hit its rule: the counters add up to the frames.
+    uint64_t counted = 0;
+    Hash_Iterate(ctx->ruleHash, CountHits, &counted);
+    if (counted != kExactFrames) {
+      std::fprintf(stderr, "exact rules counted %llu of %zu frames\n",
+                   static_cast<unsigned long long>(counted), kExactFrames);
+      std::abort();
+    }
+  }
+  ~ExactBench() {
+    lists_.clear();
+    host::Loader::Unload();
+    host::Reset();
+  }
+  bool Is(uint32_t n) const { return n_ == n; }
+  void RunOne() {
+    host::PacketList& list = *lists_[next_];
+    if (++next_ == lists_.size()) next_ = 0;
+    ZelStatus st = SLCGenericProcessPackets(priv_, list.get(), 1);
+    benchmark::DoNotOptimize(st);
+  }
+
+ private:
+  static bool CountHits(void* elem, void* arg) {
+    *static_cast<uint64_t*>(arg) += static_cast<FWRuleEntry*>(elem)->rule.pktCount;
+    return true;
+  }
+  uint32_t n_;
+  host::FilterId id_ = 0;
+  void* priv_ = nullptr;
+  std::vector<std::unique_ptr<host::PacketList>> lists_;
+  size_t next_ = 0;
+};
+
+std::unique_ptr<ExactBench> exactBench;
+void DropExactBench() { exactBench.reset(); }
+
+void BM_ExactHits(benchmark::State& state) {
+  const uint32_t n = static_cast<uint32_t>(state.range(0));
+  current.reset();
+  if (!exactBench || !exactBench->Is(n)) {
+    exactBench.reset();
+    exactBench = std::make_unique<ExactBench>(n);
+  }
+  for (auto _ : state) exactBench->RunOne();
+  const double items = static_cast<double>(state.iterations()) * kListLen;
+  state.SetItemsProcessed(static_cast<int64_t>(items));
+  state.counters["ns_per_pkt"] =
+      benchmark::Counter(items, benchmark::Counter::kIsRate | benchmark::Counter::kInvert);
+  state.counters["rules"] = static_cast<double>(n);
+}
 
 #ifdef SLC_HAVE_DPDK
 // The peer classifier on the generator's rules: five fields (protocol as a
@@ -486,6 +614,69 @@ void PeerTimed(benchmark::State& state, enum rte_acl_classify_alg method) {
 void BM_PeerAclScalar(benchmark::State& state) { PeerTimed(state, RTE_ACL_CLASSIFY_SCALAR); }
 void BM_PeerAclBest(benchmark::State& state) { PeerTimed(state, RTE_ACL_CLASSIFY_DEFAULT); }
 
+
+// The peer hash table on the same flows: 16-byte keys (the generator's
+// Key), the rule number as data, bulk lookups of 64.
+void BM_PeerHashBulk(benchmark::State& state) {
+  const uint32_t n = static_cast<uint32_t>(state.range(0));
+  char name[32];
+  std::snprintf(name, sizeof(name), "exact%u", n);
+  rte_hash_parameters params{};
+  params.name = name;
+  params.entries = n < 1024 ? 1024 : n;
+  params.key_len = sizeof(Key);
+  params.hash_func = rte_hash_crc;
+  params.socket_id = SOCKET_ID_ANY;
+  rte_hash* h = rte_hash_create(&params);
+  if (h == nullptr) {
+    state.SkipWithError("rte_hash_create failed");
+    return;
+  }
+  for (uint32_t i = 0; i < n; i++) {
+    const Key k = FlowKey(i);
+    if (rte_hash_add_key_data(h, &k, reinterpret_cast<void*>(uintptr_t{i} + 1)) != 0) {
+      state.SkipWithError("rte_hash_add_key_data failed");
+      rte_hash_free(h);
+      return;
+    }
+  }
+  std::vector<Key> keys(kExactFrames);
+  std::vector<const void*> ptrs(kExactFrames);
+  for (size_t f = 0; f < kExactFrames; f++) {
+    keys[f] = FlowKey(FlowOfFrame(f, n));
+    ptrs[f] = &keys[f];
+  }
+  void* data[kListLen];
+  uint64_t hits = 0;
+  // One checked pass.
+  for (size_t f = 0; f < kExactFrames; f += kListLen) {
+    if (rte_hash_lookup_bulk_data(h, ptrs.data() + f, kListLen, &hits, data) != kListLen) {
+      state.SkipWithError("a peer lookup missed");
+      rte_hash_free(h);
+      return;
+    }
+    for (size_t k = 0; k < kListLen; k++) {
+      if (reinterpret_cast<uintptr_t>(data[k]) != FlowOfFrame(f + k, n) + 1u) {
+        std::fprintf(stderr, "peer hash: frame %zu found the wrong rule\n", f + k);
+        std::abort();
+      }
+    }
+  }
+  size_t next = 0;
+  for (auto _ : state) {
+    rte_hash_lookup_bulk_data(h, ptrs.data() + next, kListLen, &hits, data);
+    benchmark::DoNotOptimize(data[0]);
+    next += kListLen;
+    if (next == kExactFrames) next = 0;
+  }
+  const double items = static_cast<double>(state.iterations()) * kListLen;
+  state.SetItemsProcessed(static_cast<int64_t>(items));
+  state.counters["ns_per_pkt"] =
+      benchmark::Counter(items, benchmark::Counter::kIsRate | benchmark::Counter::kInvert);
+  state.counters["rules"] = static_cast<double>(n);
+  rte_hash_free(h);
+}
+
 bool InitPeer(const char* argv0) {
   const char* args[] = {argv0, "--no-huge", "--no-pci", "--no-shconf", "-m", "1024", "-l", "0",
                         "--log-level=3"};
@@ -517,10 +708,17 @@ int main(int argc, char** argv) {
     }
 #endif
   }
+  for (int n : {10000, 1000000}) {
+    benchmark::RegisterBenchmark("BM_ExactHits", BM_ExactHits)->Arg(n);
+#ifdef SLC_HAVE_DPDK
+    if (peerReady) benchmark::RegisterBenchmark("BM_PeerHashBulk", BM_PeerHashBulk)->Arg(n);
+#endif
+  }
   (void)peerReady;
   benchmark::RunSpecifiedBenchmarks();
   benchmark::Shutdown();
   current.reset();
+  exactBench.reset();
 #ifdef SLC_HAVE_DPDK
   peer.reset();
 #endif
