@@ -152,7 +152,6 @@ struct Builder {
   HeapArray<uint32_t> leaves;
   HeapArray<uint32_t> scratch;  // rule lists of the nodes being built, as a stack
   HeapArray<uint32_t> counts;   // per child, 2^kMaxCutBits + 1
-  bool failed = false;
 
   [[nodiscard]] bool MakeLeaf(uint32_t node, uint32_t off, uint32_t count) {
     if (!leaves.Reserve(uint64_t{leaves.size} + count)) return false;
