@@ -184,6 +184,23 @@ void FWReleaseList(ListLinks* head) {
 
 ZelStatus FWApplyRuleset(SLCGenericFilter* filter, FWRuleset* ruleset, uint32_t replace,
                          uint32_t fromIoctl) {
+  return FWApplyPreparedRuleset(filter, ruleset, replace, fromIoctl, nullptr);
+}
+
+namespace {
+
+// Frees a prepared classifier that the application did not take.
+struct FWPreparedGuard {
+  FWClassifier* classifier;
+  ~FWPreparedGuard() { FWClassifierFree(&classifier); }
+};
+
+}  // namespace
+
+ZelStatus FWApplyPreparedRuleset(SLCGenericFilter* filter, FWRuleset* ruleset, uint32_t replace,
+                                 uint32_t fromIoctl, FWClassifier* prepared) {
+  FWPreparedGuard preparedGuard{replace != 0 ? prepared : nullptr};
+  if (replace == 0) FWClassifierFree(&prepared);
   FWFilterContext* ctx = FWContext(filter);
 
   // Once a ruleset came by an ioctl road, the property and restores are
@@ -247,7 +264,7 @@ ZelStatus FWApplyRuleset(SLCGenericFilter* filter, FWRuleset* ruleset, uint32_t 
   // The scan index of the general rules as they now stand (the former ones
   // first when adding); the former index stays in force until success.
   FWScanIndex* index = nullptr;
-  if (ok && FWScanIndexBuild(&ctx->ruleList, &index) != ZEL_OK) {
+  if (ok && FWScanIndexBuild(&ctx->ruleList, &index, &preparedGuard.classifier) != ZEL_OK) {
     SLCG_LOG_OBJ(SLCG_ATTENTION, filter->name, "Failed to allocate general rule index");
     ok = false;
   }

@@ -309,16 +309,11 @@ struct Builder {
 
 }  // namespace
 
-ZelStatus FWClassifierBuild(FWRuleEntry* const* entries, uint32_t count,
-                            FWClassifier** classifier) {
-  *classifier = nullptr;
-  if (count < g_fwClassifierTuning.minRules || count == 0) return ZEL_OK;
+namespace {
 
-  const uint64_t boxBytes = uint64_t{count} * sizeof(Box);
-  if (boxBytes > UINT32_MAX) return ZEL_NO_MEMORY;
-  auto* boxes = static_cast<Box*>(SLCGenericAlloc(static_cast<uint32_t>(boxBytes)));
-  if (boxes == nullptr) return ZEL_NO_MEMORY;
-
+// Builds the classifier of `count` rules whose projections fill `boxes`
+// (already filled; released by the caller).
+ZelStatus BuildFromBoxes(Box* boxes, uint32_t count, FWClassifier** classifier) {
   ZelStatus status = ZEL_NO_MEMORY;
   {
     Builder b;
@@ -329,7 +324,6 @@ ZelStatus FWClassifierBuild(FWRuleEntry* const* entries, uint32_t count,
               b.scratch.Reserve(count);
     uint32_t members[FW_CLS_TREES] = {};
     for (uint32_t i = 0; ok && i < count; i++) {
-      Project(entries[i]->rule, &boxes[i]);
       tree[i] = static_cast<uint8_t>(TreeOf(boxes[i]));
       if (tree[i] == FW_CLS_TREES) {
         ok = residual.Push(i);
@@ -376,6 +370,7 @@ ZelStatus FWClassifierBuild(FWRuleEntry* const* entries, uint32_t count,
           zel_Memcpy(rest, residual.data, static_cast<size_t>(residual.size) * 4);
         }
         for (uint32_t t = 0; t < FW_CLS_TREES; t++) c->roots[t] = roots[t];
+        c->numRules = count;
         c->numNodes = b.nodes.size;
         c->numLeafSlots = b.leaves.size;
         c->numResidual = residual.size;
@@ -388,6 +383,53 @@ ZelStatus FWClassifierBuild(FWRuleEntry* const* entries, uint32_t count,
       }
     }
   }
+  return status;
+}
+
+// The rules' projections, in a block of the module heap; null when it
+// cannot be had.
+Box* AllocBoxes(uint32_t count) {
+  const uint64_t bytes = uint64_t{count} * sizeof(Box);
+  if (count == 0 || bytes > UINT32_MAX) return nullptr;
+  return static_cast<Box*>(SLCGenericAlloc(static_cast<uint32_t>(bytes)));
+}
+
+}  // namespace
+
+ZelStatus FWClassifierBuild(FWRuleEntry* const* entries, uint32_t count,
+                            FWClassifier** classifier) {
+  *classifier = nullptr;
+  if (count < g_fwClassifierTuning.minRules || count == 0) return ZEL_OK;
+  Box* boxes = AllocBoxes(count);
+  if (boxes == nullptr) return ZEL_NO_MEMORY;
+  for (uint32_t i = 0; i < count; i++) Project(entries[i]->rule, &boxes[i]);
+  const ZelStatus status = BuildFromBoxes(boxes, count, classifier);
+  SLCGenericFree(boxes);
+  return status;
+}
+
+ZelStatus FWClassifierPrepare(FWRuleset* ruleset, FWClassifier** classifier) {
+  *classifier = nullptr;
+  const uint32_t version = ruleset->version;
+  if (version != FW_RULESET_VERSION_7 && version != FW_RULESET_VERSION_8) return ZEL_OK;
+  const uint32_t records = ruleset->numRules;
+  if (records < g_fwClassifierTuning.minRules) return ZEL_OK;
+  Box* boxes = AllocBoxes(records);
+  if (boxes == nullptr) return ZEL_NO_MEMORY;
+  // The general records, in ruleset order, as the application installs
+  // them: the slots of a replacing application's index.
+  uint32_t count = 0;
+  for (uint32_t i = 0; i < records; i++) {
+    uint64_t size = 0;
+    const uint8_t* record = FWGetRuleFromRuleset(version, ruleset, i, &size);
+    FWRule work;
+    zel_Memset(&work, 0, sizeof(work));
+    zel_Memcpy(&work, record, size);
+    FWUpdateWildcardsToCurrent(version, &work);
+    if (work.ruleFlags & FW_GENERAL_RULE_MASK) Project(work, &boxes[count++]);
+  }
+  ZelStatus status = ZEL_OK;
+  if (count >= g_fwClassifierTuning.minRules) status = BuildFromBoxes(boxes, count, classifier);
   SLCGenericFree(boxes);
   return status;
 }

@@ -56,6 +56,7 @@ inline constexpr uint32_t FW_CLS_NO_TREE = 0xffffffffu;
 
 struct FWClassifier {
   uint32_t roots[FW_CLS_TREES];  // node number of each tree's root, or FW_CLS_NO_TREE
+  uint32_t numRules;             // slots it was built for
   uint32_t numNodes;
   uint32_t numLeafSlots;
   uint32_t numResidual;
@@ -87,6 +88,22 @@ struct FWRuleEntry;
 [[nodiscard]] ZelStatus FWClassifierBuild(FWRuleEntry* const* entries, uint32_t count,
                                           FWClassifier** classifier);
 void FWClassifierFree(FWClassifier** classifier);
+
+// Builds, from a ruleset about to replace a filter's rules, the classifier
+// its application would build: the general records, in order, widened as
+// installed. Needs no lock (it reads only the ruleset, whose length the
+// caller has checked), so the build happens before the exclusive hold.
+// Null and ZEL_OK when none would be built; ZEL_NO_MEMORY when an
+// allocation fails (nothing is then allocated).
+[[nodiscard]] ZelStatus FWClassifierPrepare(FWRuleset* ruleset, FWClassifier** classifier);
+
+// FWApplyRuleset with the classifier FWClassifierPrepare made of the same
+// ruleset (or null), configLock held exclusively. Takes `prepared` over
+// whatever happens: a replacing application installs it in place of
+// building one, anything else frees it.
+[[nodiscard]] ZelStatus FWApplyPreparedRuleset(SLCGenericFilter* filter, FWRuleset* ruleset,
+                                               uint32_t replace, uint32_t fromIoctl,
+                                               FWClassifier* prepared);
 
 // The packet's value on every dimension.
 struct FWClsKey {

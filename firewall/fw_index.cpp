@@ -175,7 +175,8 @@ void SlotFromRule(const FWRule& r, FWScanSlot* slot) {
 
 }  // namespace
 
-ZelStatus FWScanIndexBuild(const ListLinks* ruleList, FWScanIndex** index) {
+ZelStatus FWScanIndexBuild(const ListLinks* ruleList, FWScanIndex** index,
+                           FWClassifier** prepared) {
   *index = nullptr;
   uint64_t count = 0;
   for (const ListLinks* l = ruleList->prev; l != ruleList; l = l->prev) count++;
@@ -200,7 +201,10 @@ ZelStatus FWScanIndexBuild(const ListLinks* ruleList, FWScanIndex** index) {
   }
   idx->count = i;
   idx->classifier = nullptr;
-  if (FWClassifierBuild(idx->entries, idx->count, &idx->classifier) != ZEL_OK) {
+  if (*prepared != nullptr && (*prepared)->numRules == idx->count) {
+    idx->classifier = *prepared;
+    *prepared = nullptr;
+  } else if (FWClassifierBuild(idx->entries, idx->count, &idx->classifier) != ZEL_OK) {
     SLCGenericFree(block);
     return ZEL_NO_MEMORY;
   }

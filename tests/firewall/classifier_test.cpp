@@ -241,7 +241,7 @@ class ClassifierTest : public FirewallTest {
 };
 
 TEST_F(ClassifierTest, SameRuleAsTheOrderedScanForEveryPacket) {
-  uint64_t id = 1, built = 0, residual = 0;
+  uint64_t id = 1, built = 0, residual = 0, prepared = 0;
   for (uint32_t iter = 0; iter < 400; iter++) {
     Gen gen(0xc1a55000u + iter);
     // Leaves of 1 to 8 rules, and now and then a budget that stops the
@@ -255,7 +255,16 @@ TEST_F(ClassifierTest, SameRuleAsTheOrderedScanForEveryPacket) {
       const uint32_t n = 1 + gen.U(a == 0 ? 300 : 60);
       for (uint32_t i = 0; i < n; i++) b.Add(gen.Rule(version, id++));
       const auto rs = b.Bytes();
-      ASSERT_EQ(Apply(rs, a == 0), ZEL_OK);
+      if (a == 0 && gen.P(50)) {
+        // The control channel's road: the classifier built before the
+        // exclusive hold.
+        std::vector<uint8_t> copy(rs);
+        ASSERT_EQ(FWSetIoctlRuleset(filter_, reinterpret_cast<FWRuleset*>(copy.data()), 1),
+                  ZEL_OK);
+        prepared++;
+      } else {
+        ASSERT_EQ(Apply(rs, a == 0), ZEL_OK);
+      }
       model.Apply(rs, a == 0);
     }
     ASSERT_NE(ctx_->scanIndex, nullptr);
@@ -283,6 +292,7 @@ TEST_F(ClassifierTest, SameRuleAsTheOrderedScanForEveryPacket) {
     if (HasFailure()) return;
   }
   EXPECT_EQ(built, 400u);
+  EXPECT_GT(prepared, 100u);
   EXPECT_GT(residual, 0u);
   EXPECT_GT(hits_, checked_ / 3);
   RecordProperty("hits", std::to_string(hits_) + "/" + std::to_string(checked_));
@@ -339,6 +349,42 @@ TEST_F(ClassifierTest, AllocationFailureAnywhereInTheBuildChangesNothing) {
     ExpectSameAsModel(gen, model, 0, 2000);
     ASSERT_EQ(Apply(first.Bytes(), true), ZEL_OK);
   }
+}
+
+// The control channel's road prepares the classifier before the hold: an
+// allocation failed there only moves the build under the hold; failed
+// anywhere else, the filter stays as it was. Either way nothing leaks.
+TEST_F(ClassifierTest, PreparedBeforeTheHoldUnderAllocationFailure) {
+  g_fwClassifierTuning = {1, 2, 24, 64};
+  Gen gen(0xbefe);
+  rules::RulesetBuilder first(8), next(8);
+  for (uint64_t i = 0; i < 80; i++) first.Add(gen.Rule(8, i + 1));
+  for (uint64_t i = 0; i < 80; i++) next.Add(gen.Rule(8, 1000 + i));
+  ASSERT_EQ(Apply(first.Bytes(), true), ZEL_OK);
+  FwModel model;
+  model.Apply(next.Bytes(), true);
+  uint64_t succeeded = 0;
+  for (uint64_t n = 1;; n++) {
+    const Fingerprint before = Capture();
+    std::vector<uint8_t> copy = next.Bytes();
+    host::Faults::Fail("zel_HeapAllocWithRA", ZEL_NO_MEMORY, n);
+    const ZelStatus status =
+        FWSetIoctlRuleset(filter_, reinterpret_cast<FWRuleset*>(copy.data()), 1);
+    const bool injected = host::Faults::Injected("zel_HeapAllocWithRA") > 0;
+    host::Faults::ClearAll();
+    if (status == ZEL_OK) {
+      succeeded++;
+      ASSERT_NE(ctx_->scanIndex->classifier, nullptr);
+      ExpectSameAsModel(gen, model, static_cast<uint32_t>(n), 300);
+      if (!injected) break;
+      ASSERT_EQ(Apply(first.Bytes(), true), ZEL_OK);
+      EXPECT_EQ(Capture().heapBlocks, before.heapBlocks) << "allocation " << n;
+    } else {
+      ASSERT_TRUE(Capture() == before) << "allocation " << n << " changed the filter";
+    }
+  }
+  // Failures inside the preparation were absorbed by the build under the hold.
+  EXPECT_GT(succeeded, 1u);
 }
 
 }  // namespace
