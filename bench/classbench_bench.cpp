@@ -25,6 +25,17 @@
 //                                bursts of 64 prepared 5-tuples
 // Its first match is checked against the ordered scan for every packet.
 //
+// The packet path's wait while a ruleset replaces another (configLock held
+// exclusively), with packets flowing on another thread:
+//   BM_ApplyHold/<rules>/<prepared>     10,000 ClassBench-like general
+//                                 rules replace 10,000 others (and back);
+//                                 prepared 1: the control channel's road,
+//                                 classifier built before the hold
+//   BM_ExactApplyHold/<rules>     exact rules replace as many others
+// Counters: stall_ms, the longest call of the packet thread while rules
+// were replaced (its list's own time included, a few microseconds);
+// apply_ms, the whole replacement as the caller sees it.
+//
 // Exact hits, 2^18 distinct frames (flows drawn at random among the
 // rules, so at 1,000,000 rules frames and entries are cache-cold):
 //   BM_ExactHits/<rules>          the whole path, every packet a hit
@@ -39,7 +50,9 @@
 #include <benchmark/benchmark.h>
 
 #include <cstdio>
+#include <atomic>
 #include <memory>
+#include <thread>
 #include <string>
 #include <vector>
 
@@ -170,6 +183,58 @@ FWRule MixedRecordOf(const Rule4& x, uint32_t i, bool* matchesNothing) {
   return r;
 }
 
+// Replaces the rules of `priv` with `a` and `b` in turn, `rounds` times,
+// while another thread sends `lists` through the packet path; the longest
+// packet call seen while replacing, and the mean replacement, in ms.
+struct HoldResult {
+  double stallMs, applyMs;
+};
+
+HoldResult MeasureHold(void* priv, std::vector<std::unique_ptr<host::PacketList>>& lists,
+                       const std::vector<uint8_t>& a, const std::vector<uint8_t>& b,
+                       bool prepared, int rounds) {
+  auto* filter = static_cast<SLCGenericFilter*>(priv);
+  std::atomic<bool> stop{false}, applying{false};
+  std::atomic<double> worst{0};
+  std::thread packets([&] {
+    size_t next = 0;
+    while (!stop.load(std::memory_order_relaxed)) {
+      const bool during = applying.load(std::memory_order_acquire);
+      const double t0 = now_ns();
+      (void)SLCGenericProcessPackets(priv, lists[next]->get(), 1);
+      const double took = now_ns() - t0;
+      if ((during || applying.load(std::memory_order_acquire)) && took > worst.load()) {
+        worst.store(took);
+      }
+      if (++next == lists.size()) next = 0;
+    }
+  });
+  double total = 0;
+  for (int r = 0; r < rounds; r++) {
+    std::vector<uint8_t> copy(r % 2 == 0 ? a : b);
+    auto* rs = reinterpret_cast<FWRuleset*>(copy.data());
+    applying.store(true, std::memory_order_release);
+    const double t0 = now_ns();
+    ZelStatus st;
+    if (prepared) {
+      st = FWSetIoctlRuleset(filter, rs, 1);
+    } else {
+      SLCGenericWriteGuard guard(FWContext(filter)->configLock);
+      st = FWApplyRuleset(filter, rs, 1, 1);
+    }
+    total += now_ns() - t0;
+    std::this_thread::sleep_for(std::chrono::milliseconds(2));  // the stalled call ends
+    applying.store(false, std::memory_order_release);
+    if (st != ZEL_OK) {
+      std::fprintf(stderr, "replacement failed\n");
+      std::abort();
+    }
+  }
+  stop.store(true);
+  packets.join();
+  return {worst.load() / 1e6, total / rounds / 1e6};
+}
+
 class Bench {
  public:
   Bench(uint32_t n, bool mixed, bool scanOnly) : n_(n), mixed_(mixed), scanOnly_(scanOnly) {
@@ -279,7 +344,18 @@ class Bench {
   }
   double applyMs_ = 0;
 
+  HoldResult Hold(bool prepared) {
+    if (other_.empty()) {
+      const std::vector<Rule4> rules = gen_rules(static_cast<int>(n_), 0x0dd50000ull + n_);
+      rules::RulesetBuilder builder(8);
+      for (const Rule4& x : rules) builder.Add(RecordOf(x));
+      other_ = builder.Bytes();
+    }
+    return MeasureHold(priv_, lists_, other_, ruleset_, prepared, 10);
+  }
+
  private:
+  std::vector<uint8_t> other_;
   std::vector<FWRuleEntry*> Entries() {
     std::vector<FWRuleEntry*> v;
     FWFilterContext* ctx = FWContext(static_cast<SLCGenericFilter*>(priv_));
@@ -314,6 +390,7 @@ class Bench {
   std::vector<std::unique_ptr<host::PacketList>> lists_;
   size_t next_ = 0;
 };
+
 
 std::unique_ptr<Bench> current;
 class ExactBench;
@@ -438,6 +515,22 @@ class ExactBench {
     host::Reset();
   }
   bool Is(uint32_t n) const { return n_ == n; }
+
+  // Exact rulesets of the same size: the installed flows and the next n.
+  HoldResult Hold() {
+    FWRule rule = rules::ParseRule(
+        "action=accept dmac=02:00:00:00:00:02 smac=02:00:00:00:00:01 ethtype=0x0800 "
+        "vlan=none sa=10.0.0.0 da=192.168.0.1 proto=tcp sport=1234 dport=80");
+    rules::RulesetBuilder mine(8), other(8);
+    for (uint32_t i = 0; i < n_; i++) {
+      PutNet32(rule.ipSa, FlowKey(i).src);
+      mine.Add(rule);
+      PutNet32(rule.ipSa, FlowKey(n_ + i).src);
+      other.Add(rule);
+    }
+    return MeasureHold(priv_, lists_, other.Bytes(), mine.Bytes(), true, 4);
+  }
+
   void RunOne() {
     host::PacketList& list = *lists_[next_];
     if (++next_ == lists_.size()) next_ = 0;
@@ -474,6 +567,29 @@ void BM_ExactHits(benchmark::State& state) {
       benchmark::Counter(items, benchmark::Counter::kIsRate | benchmark::Counter::kInvert);
   state.counters["rules"] = static_cast<double>(n);
 }
+
+void BM_ApplyHold(benchmark::State& state) {
+  Bench& b = Use(static_cast<uint32_t>(state.range(0)), false);
+  HoldResult r{};
+  for (auto _ : state) r = b.Hold(state.range(1) != 0);
+  state.counters["stall_ms"] = r.stallMs;
+  state.counters["apply_ms"] = r.applyMs;
+}
+BENCHMARK(BM_ApplyHold)->Args({10000, 0})->Args({10000, 1})->Iterations(1)->UseRealTime();
+
+void BM_ExactApplyHold(benchmark::State& state) {
+  const uint32_t n = static_cast<uint32_t>(state.range(0));
+  current.reset();
+  if (!exactBench || !exactBench->Is(n)) {
+    exactBench.reset();
+    exactBench = std::make_unique<ExactBench>(n);
+  }
+  HoldResult r{};
+  for (auto _ : state) r = exactBench->Hold();
+  state.counters["stall_ms"] = r.stallMs;
+  state.counters["apply_ms"] = r.applyMs;
+}
+BENCHMARK(BM_ExactApplyHold)->Arg(100000)->Iterations(1)->UseRealTime();
 
 #ifdef SLC_HAVE_DPDK
 // The peer classifier on the generator's rules: five fields (protocol as a
