@@ -10,7 +10,8 @@
 //     originals' sockets and tags; whichever record survives owns them) and
 //     the new general rules are linked in front of the former ones.
 // Success installs a new scan index of the general rules (fw_index.h),
-// allocated last, and releases what was replaced (or only the memory of the
+// allocated last (with the classifier prepared before the hold, when the
+// caller made one), and releases what was replaced (or only the memory of the
 // originals when adding). Undo releases what this application created and
 // restores the snapshot (the former index with it).
 //
