@@ -10,7 +10,8 @@
 //     originals' sockets and tags; whichever record survives owns them) and
 //     the new general rules are linked in front of the former ones.
 // Success installs a new scan index of the general rules (fw_index.h),
-// allocated last, and releases what was replaced (or only the memory of the
+// allocated last (with the classifier prepared before the hold, when the
+// caller made one), and releases what was replaced (or only the memory of the
 // originals when adding). Undo releases what this application created and
 // restores the snapshot (the former index with it).
 //
@@ -184,6 +185,23 @@ void FWReleaseList(ListLinks* head) {
 
 ZelStatus FWApplyRuleset(SLCGenericFilter* filter, FWRuleset* ruleset, uint32_t replace,
                          uint32_t fromIoctl) {
+  return FWApplyPreparedRuleset(filter, ruleset, replace, fromIoctl, nullptr);
+}
+
+namespace {
+
+// Frees a prepared classifier that the application did not take.
+struct FWPreparedGuard {
+  FWClassifier* classifier;
+  ~FWPreparedGuard() { FWClassifierFree(&classifier); }
+};
+
+}  // namespace
+
+ZelStatus FWApplyPreparedRuleset(SLCGenericFilter* filter, FWRuleset* ruleset, uint32_t replace,
+                                 uint32_t fromIoctl, FWClassifier* prepared) {
+  FWPreparedGuard preparedGuard{replace != 0 ? prepared : nullptr};
+  if (replace == 0) FWClassifierFree(&prepared);
   FWFilterContext* ctx = FWContext(filter);
 
   // Once a ruleset came by an ioctl road, the property and restores are
@@ -247,7 +265,7 @@ ZelStatus FWApplyRuleset(SLCGenericFilter* filter, FWRuleset* ruleset, uint32_t 
   // The scan index of the general rules as they now stand (the former ones
   // first when adding); the former index stays in force until success.
   FWScanIndex* index = nullptr;
-  if (ok && FWScanIndexBuild(&ctx->ruleList, &index) != ZEL_OK) {
+  if (ok && FWScanIndexBuild(&ctx->ruleList, &index, &preparedGuard.classifier) != ZEL_OK) {
     SLCG_LOG_OBJ(SLCG_ATTENTION, filter->name, "Failed to allocate general rule index");
     ok = false;
   }

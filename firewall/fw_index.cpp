@@ -42,10 +42,14 @@ struct SlotBuilder {
       Require(1, 0xffffffffull << shift, static_cast<uint64_t>(FWLoad32(lo)) << shift);
       return;
     }
-    exact = false;
     const uint32_t l = FWNet32(lo), h = FWNet32(hi);
-    if (l > h) return;
+    if (l > h) {
+      exact = false;
+      return;
+    }
     const uint32_t prefix = CommonPrefix32(l, h);
+    // A range that is exactly a prefix is exactly its masked equality.
+    if ((l & ~prefix) != 0 || (h | prefix) != 0xffffffffu) exact = false;
     Require(1, static_cast<uint64_t>(__builtin_bswap32(prefix)) << shift,
             static_cast<uint64_t>(__builtin_bswap32(l & prefix)) << shift);
   }
@@ -56,10 +60,13 @@ struct SlotBuilder {
       Require(0, 0xffffull << shift, static_cast<uint64_t>(FWLoad16(lo)) << shift);
       return;
     }
-    exact = false;
     const uint32_t l = FWNet16(lo), h = FWNet16(hi);
-    if (l > h) return;
+    if (l > h) {
+      exact = false;
+      return;
+    }
     const uint32_t prefix = CommonPrefix32(l << 16, h << 16) >> 16;
+    if ((l & ~prefix) != 0 || (h | prefix) != 0xffffu) exact = false;
     Require(0, static_cast<uint64_t>(__builtin_bswap16(static_cast<uint16_t>(prefix))) << shift,
             static_cast<uint64_t>(__builtin_bswap16(static_cast<uint16_t>(l & prefix)))
                 << shift);
@@ -168,7 +175,8 @@ void SlotFromRule(const FWRule& r, FWScanSlot* slot) {
 
 }  // namespace
 
-ZelStatus FWScanIndexBuild(const ListLinks* ruleList, FWScanIndex** index) {
+ZelStatus FWScanIndexBuild(const ListLinks* ruleList, FWScanIndex** index,
+                           FWClassifier** prepared) {
   *index = nullptr;
   uint64_t count = 0;
   for (const ListLinks* l = ruleList->prev; l != ruleList; l = l->prev) count++;
@@ -192,12 +200,21 @@ ZelStatus FWScanIndexBuild(const ListLinks* ruleList, FWScanIndex** index) {
     idx->entries[i] = entry;
   }
   idx->count = i;
+  idx->classifier = nullptr;
+  if (*prepared != nullptr && (*prepared)->numRules == idx->count) {
+    idx->classifier = *prepared;
+    *prepared = nullptr;
+  } else if (FWClassifierBuild(idx->entries, idx->count, &idx->classifier) != ZEL_OK) {
+    SLCGenericFree(block);
+    return ZEL_NO_MEMORY;
+  }
   *index = idx;
   return ZEL_OK;
 }
 
 void FWScanIndexFree(FWScanIndex** index) {
   if (*index != nullptr) {
+    FWClassifierFree(&(*index)->classifier);
     SLCGenericFree(*index);
     *index = nullptr;
   }
@@ -208,6 +225,14 @@ void FWScanIndexForget(FWScanIndex* index, const FWRuleEntry* entry) {
   if (index == nullptr || (entry->rule.ruleFlags & FW_GENERAL_RULE_MASK) == 0) return;
   for (uint32_t i = 0; i < index->count; i++) {
     if (index->entries[i] != entry) continue;
+    if (index->classifier != nullptr) {
+      FWScanSlot& slot = index->slots[i];
+      slot = FWScanSlot{};
+      slot.value[0] = FW_KEY0_NEVER;
+      slot.mask[0] = FW_KEY0_NEVER;
+      index->entries[i] = nullptr;
+      return;
+    }
     // Compact in place, front to back, keeping ruleset order.
     for (uint32_t j = i + 1; j < index->count; j++) {
       index->slots[j - 1] = index->slots[j];

@@ -8,9 +8,10 @@
 // every test of the rule that can be expressed that way:
 //   - presence (every field the rule compares), direction, address family;
 //   - MACs (with their masks), ethertype, protocol, IPv4 addresses and
-//     ports compared for equality;
-//   - a necessary condition for the rest: the common leading bits of an
-//     IPv4 or port range, a 16-bit fold of the 802.1Q tag, 32-bit folds of
+//     ports compared for equality, and IPv4 or port ranges that are
+//     exactly a prefix;
+//   - a necessary condition for the rest: the common leading bits of any
+//     other IPv4 or port range, a 16-bit fold of the 802.1Q tag, 32-bit folds of
 //     IPv6 addresses.
 // Negated fields, IPv6 ranges and the resource-pool tag are left out (mask
 // 0). A slot that passes goes through the full step-by-step test of the
@@ -18,10 +19,13 @@
 // the rule is exactly the masked equality and passing it is matching.
 //
 // Invariant (configLock): while the filter has general rules, scanIndex
-// lists exactly the entries of ruleList, back to front (ruleset order); with
-// none it is null or empty.
+// lists exactly the entries of ruleList, back to front (ruleset order), and
+// slots of entries removed since it was built (entries[i] null, slot never
+// passing); with none it is null or empty. A large index carries the
+// compiled classifier (fw_classifier.h) of its slots.
 #pragma once
 
+#include "firewall/fw_classifier.h"
 #include "firewall/fw_rules.h"
 
 struct FWScanSlot {
@@ -35,6 +39,7 @@ struct FWScanIndex {
   uint32_t capacity;
   FWScanSlot* slots;       // inside this block, 64-byte aligned
   FWRuleEntry** entries;   // inside this block; entries[i] belongs to slots[i]
+  FWClassifier* classifier;  // separate block, or null: scan every slot
 };
 
 // Key word 0: ports and protocol as stored, presence bits 0-9, the family
@@ -75,10 +80,15 @@ inline uint64_t FWFold32(uint64_t rawHi, uint64_t rawLo) {
 }
 
 // Builds the index of `ruleList` (entries linked at the front, so walked
-// from the back). An empty list yields null and ZEL_OK. ZEL_NO_MEMORY when
-// the block cannot be allocated; nothing is then allocated.
-[[nodiscard]] ZelStatus FWScanIndexBuild(const ListLinks* ruleList, FWScanIndex** index);
+// from the back), with its classifier: `*prepared` when it was built for
+// exactly these rules (taken over, *prepared set to null), else a new one.
+// An empty list yields null and ZEL_OK. ZEL_NO_MEMORY when an allocation
+// fails; nothing is then allocated (and *prepared is left as it was).
+[[nodiscard]] ZelStatus FWScanIndexBuild(const ListLinks* ruleList, FWScanIndex** index,
+                                         FWClassifier** prepared);
 void FWScanIndexFree(FWScanIndex** index);
 // Drops the slot of `entry`, if any, keeping the others in order; allocates
-// nothing. Called before the entry is unlinked and freed.
+// nothing. Called before the entry is unlinked and freed. With a
+// classifier, whose leaves name slots by number, the slot stays as a
+// tombstone instead: it never passes and its entry is null.
 void FWScanIndexForget(FWScanIndex* index, const FWRuleEntry* entry);

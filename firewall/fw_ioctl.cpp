@@ -289,8 +289,14 @@ ZelStatus FWValidateRulesetSize(uint32_t version, uint32_t numRules, uint64_t le
 
 ZelStatus FWSetIoctlRuleset(SLCGenericFilter* filter, FWRuleset* ruleset, uint32_t replace) {
   FWFilterContext* ctx = FWContext(filter);
+  // A replacing ruleset's classifier depends on nothing but the ruleset:
+  // built before the exclusive hold, the packet path keeps flowing
+  // meanwhile. Without memory for it now, the application builds it under
+  // the hold as usual (and fails cleanly if memory is still short).
+  FWClassifier* prepared = nullptr;
+  if (replace != 0 && FWClassifierPrepare(ruleset, &prepared) != ZEL_OK) prepared = nullptr;
   SLCGenericWriteGuard hold(ctx->configLock);
-  return FWApplyRuleset(filter, ruleset, replace, 1);
+  return FWApplyPreparedRuleset(filter, ruleset, replace, 1, prepared);
 }
 
 void FWFilterIoctlRequest(SLCGenericFilter* filter, uint32_t requestCode, void* payload,

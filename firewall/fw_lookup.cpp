@@ -258,6 +258,20 @@ inline FWPacketKey PacketKey(const FWScan& s) {
   return k;
 }
 
+// The packet's value on each classifier dimension (fw_classifier.h); 0 for
+// a field the packet lacks.
+inline FWClsKey ClassifierKey(const FWScan& s) {
+  const FWPktSummary* summary = s.summary;
+  const uint32_t presence = s.presence;
+  FWClsKey key;
+  key.v[0] = (presence & FW_WC_IPSA) ? FWNet32(summary->ipSa) : 0;
+  key.v[1] = (presence & FW_WC_IPDA) ? FWNet32(summary->ipDa) : 0;
+  key.v[2] = (presence & FW_WC_SPORT) ? FWNet16(summary->sPort) : 0;
+  key.v[3] = (presence & FW_WC_DPORT) ? FWNet16(summary->dPort) : 0;
+  key.v[4] = (presence & FW_WC_IPPROTO) ? summary->ipProto : 0;
+  return key;
+}
+
 }  // namespace
 
 FWRuleEntry* FWFindRuleForPacket(SLCGenericFilter* filter, ZelPkt* pkt, uint32_t direction,
@@ -288,7 +302,7 @@ FWRuleEntry* FWFindRuleForPacket(SLCGenericFilter* filter, ZelPkt* pkt, uint32_t
                      (s.v4 || s.v6 || (s.presence & (FW_WC_IPSA | FW_WC_IPDA)) == 0);
   if (__builtin_expect(!keyed, 0)) {
     for (uint32_t i = 0; i < count; i++) {
-      if (FWRuleMatches(entries[i]->rule, &s)) return entries[i];
+      if (entries[i] != nullptr && FWRuleMatches(entries[i]->rule, &s)) return entries[i];
     }
     return nullptr;
   }
@@ -302,6 +316,43 @@ FWRuleEntry* FWFindRuleForPacket(SLCGenericFilter* filter, ZelPkt* pkt, uint32_t
   auto accept = [&](uint32_t i) {
     return (slots[i].value[0] & FW_KEY0_EXACT) || FWRuleMatches(entries[i]->rule, &s);
   };
+
+  if (const FWClassifier* cls = index->classifier; cls != nullptr) {
+    // The leaf of every tree and the residual list, merged in ascending
+    // slot order: the first slot that passes its test is the first match
+    // of the whole scan, reached through the same full tests.
+    const FWClsKey key = ClassifierKey(s);
+    const uint32_t* list[FW_CLS_TREES + 1];
+    const uint32_t* end[FW_CLS_TREES + 1];
+    uint32_t lists = 0;
+    for (uint32_t t = 0; t < FW_CLS_TREES; t++) {
+      if (cls->roots[t] == FW_CLS_NO_TREE) continue;
+      uint32_t n;
+      const uint32_t* leaf = FWClassifierLeaf(cls, cls->roots[t], key, &n);
+      if (n == 0) continue;
+      list[lists] = leaf;
+      end[lists++] = leaf + n;
+    }
+    if (cls->numResidual != 0) {
+      list[lists] = cls->residual;
+      end[lists++] = cls->residual + cls->numResidual;
+    }
+    while (lists != 0) {
+      uint32_t best = 0;
+      for (uint32_t j = 1; j < lists; j++) {
+        if (*list[j] < *list[best]) best = j;
+      }
+      const uint32_t i = *list[best]++;
+      if (list[best] == end[best]) {  // exhausted: the last list takes its place
+        lists--;
+        list[best] = list[lists];
+        end[best] = end[lists];
+      }
+      if (miss(slots[i]) == 0 && accept(i)) return entries[i];
+    }
+    return nullptr;
+  }
+
   // Two slots per iteration and one branch for both while neither passes;
   // a passing pair is resolved in order, so the first match still wins.
   uint32_t i = 0;

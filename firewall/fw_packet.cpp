@@ -330,10 +330,11 @@ constexpr uint32_t kParseAhead = 8;
 constexpr uint32_t kEntryAhead = 4;
 static_assert((kRingSize & (kRingSize - 1)) == 0 && kParseAhead < kRingSize &&
               kEntryAhead < kParseAhead);
-// Tables with more buckets than this (more than 16384 exact rules) take the
-// pipelined walk: their 1 MiB of bucket heads and several MiB of entries no
-// longer sit in the per-core caches.
-constexpr uint32_t kPipelineMinBuckets = 65536;
+// Tables with at least this many buckets (a few thousand exact rules) take
+// the pipelined walk: their bucket heads and the entries behind them no
+// longer sit in the per-core caches, and a walk that waits for each miss in
+// turn costs several times one that has them in flight.
+constexpr uint32_t kPipelineMinBuckets = 16384;
 
 struct FWParsedPkt {
   ZelPkt* pkt;
@@ -455,7 +456,7 @@ void FWWalkList(FWWalk* walk, ZelPktList* list, ZelPktListIter* ahead) {
   ZelPktListIter* iter = walk->iter;
   zel_PktListIterStart(list, iter);
 
-  if (ctx->ruleHash->numBuckets <= kPipelineMinBuckets) {
+  if (ctx->ruleHash->numBuckets < kPipelineMinBuckets) {
     FWParsedPkt cur;
     while (!zel_PktListIterIsAtEnd(iter)) {
       FWParseInto<false>(zel_PktListIterGetPkt(iter), &cur, fragOverride, table);

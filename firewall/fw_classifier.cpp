@@ -1,0 +1,442 @@
+// Building the compiled classifier of the general rules (layout and
+// meaning in fw_classifier.h). Runs with configLock held exclusively, or
+// by the filter's sole owner. Every temporary comes from the module heap
+// and is released before returning, on every path.
+
+#include "firewall/fw_classifier.h"
+
+#include "firewall/fw_index.h"
+
+FWClassifierTuning g_fwClassifierTuning = kFWClassifierDefaults;
+
+namespace {
+
+constexpr uint32_t kDimBits[FW_CLS_DIMS] = {32, 32, 16, 16, 8};
+constexpr uint32_t kMaxCutBits = 8;
+// A node may copy its rules into its children at most this many times over
+// (children counted too), so that one cut never multiplies memory.
+constexpr uint64_t kSpaceFactor = 4;
+// A node costs three leaf entries (12 bytes against 4).
+constexpr uint64_t kNodeCost = sizeof(FWClsNode) / sizeof(uint32_t);
+
+// A rule's projection: inclusive intervals, numeric order.
+struct Box {
+  uint32_t lo[FW_CLS_DIMS];
+  uint32_t hi[FW_CLS_DIMS];
+};
+
+// The aligned block [base, base + 2^width - 1] of one dimension.
+struct Region {
+  uint32_t base[FW_CLS_DIMS];
+  uint8_t width[FW_CLS_DIMS];
+};
+
+inline uint64_t RegionHigh(const Region& r, uint32_t d) {
+  return static_cast<uint64_t>(r.base[d]) + ((uint64_t{1} << r.width[d]) - 1);
+}
+
+// A growable array of trivially copyable T on the module heap.
+template <typename T>
+struct HeapArray {
+  T* data = nullptr;
+  uint32_t size = 0;
+  uint32_t capacity = 0;
+
+  HeapArray() = default;
+  HeapArray(const HeapArray&) = delete;
+  HeapArray& operator=(const HeapArray&) = delete;
+  ~HeapArray() {
+    if (data != nullptr) SLCGenericFree(data);
+  }
+
+  [[nodiscard]] bool Reserve(uint64_t want) {
+    if (want <= capacity) return true;
+    uint64_t cap = capacity == 0 ? 64 : capacity;
+    while (cap < want) cap *= 2;
+    if (cap * sizeof(T) > UINT32_MAX) return false;
+    auto* grown = static_cast<T*>(SLCGenericAlloc(static_cast<uint32_t>(cap * sizeof(T))));
+    if (grown == nullptr) return false;
+    if (size != 0) zel_Memcpy(grown, data, static_cast<size_t>(size) * sizeof(T));
+    if (data != nullptr) SLCGenericFree(data);
+    data = grown;
+    capacity = static_cast<uint32_t>(cap);
+    return true;
+  }
+  [[nodiscard]] bool Push(const T& v) {
+    if (size == capacity && !Reserve(uint64_t{size} + 1)) return false;
+    data[size++] = v;
+    return true;
+  }
+};
+
+inline void Whole(Box* b, uint32_t d) {
+  b->lo[d] = 0;
+  b->hi[d] = static_cast<uint32_t>((uint64_t{1} << kDimBits[d]) - 1);
+}
+
+inline void Interval(Box* b, uint32_t d, uint32_t lo, uint32_t hi) {
+  // An empty range matches nothing unless negated (and negated fields are
+  // whole); whole is a safe over-approximation either way.
+  if (lo > hi) {
+    Whole(b, d);
+    return;
+  }
+  b->lo[d] = lo;
+  b->hi[d] = hi;
+}
+
+// See fw_classifier.h for what a projection must contain.
+void Project(const FWRule& r, Box* b) {
+  for (uint32_t d = 0; d < FW_CLS_DIMS; d++) Whole(b, d);
+  const uint32_t f = r.ruleFlags;
+  const uint32_t n = r.negateFlags;
+  auto compared = [&](uint32_t wildcard, uint32_t negate) {
+    return (f & wildcard) == 0 && (n & negate) == 0;
+  };
+
+  // A rule wildcarding both addresses matches either family: whole. A
+  // rule comparing one only matches its family, whose leading 32 bits
+  // (numeric) are the dimension; IPv6 ranges exclude their upper end,
+  // so its leading bits are still an inclusive bound.
+  if ((f & (FW_WC_IPSA | FW_WC_IPDA)) != (FW_WC_IPSA | FW_WC_IPDA)) {
+    struct Addr {
+      uint32_t wildcard, negate, range;
+      const uint8_t *lo, *hi;
+    };
+    const Addr addrs[2] = {{FW_WC_IPSA, FW_NEG_IPSA, FW_RANGE_IPSA, r.ipSa, r.ipSaHigh},
+                           {FW_WC_IPDA, FW_NEG_IPDA, FW_RANGE_IPDA, r.ipDa, r.ipDaHigh}};
+    for (uint32_t d = 0; d < 2; d++) {
+      const Addr& a = addrs[d];
+      if (!compared(a.wildcard, a.negate)) continue;
+      const uint32_t lo = FWNet32(a.lo);
+      Interval(b, d, lo, (f & a.range) ? FWNet32(a.hi) : lo);
+    }
+  }
+
+  // Ports: a rule comparing the pool tag must reach its tag test whatever
+  // the ports (the tag is read exactly when a rule passes steps 1-8).
+  if ((f & FW_WC_RPTAG) != 0) {
+    if (compared(FW_WC_SPORT, FW_NEG_SPORT)) {
+      const uint32_t lo = FWNet16(r.sPort);
+      Interval(b, 2, lo, (f & FW_RANGE_SPORT) ? FWNet16(r.sPortHigh) : lo);
+    }
+    if (compared(FW_WC_DPORT, FW_NEG_DPORT)) {
+      const uint32_t lo = FWNet16(r.dPort);
+      Interval(b, 3, lo, (f & FW_RANGE_DPORT) ? FWNet16(r.dPortHigh) : lo);
+    }
+  }
+  if (compared(FW_WC_IPPROTO, FW_NEG_IPPROTO)) Interval(b, 4, r.ipProto, r.ipProto);
+}
+
+// The tree a rule goes to, or FW_CLS_TREES for the residual list. Widths
+// are compared as fractions of their dimension.
+uint32_t TreeOf(const Box& b) {
+  uint64_t width[FW_CLS_DIMS];
+  for (uint32_t d = 0; d < FW_CLS_DIMS; d++) {
+    width[d] = (static_cast<uint64_t>(b.hi[d]) - b.lo[d]) << (32 - kDimBits[d]);
+  }
+  constexpr uint64_t kLongPrefix = uint64_t{1} << 16;  // a /16 or longer
+  constexpr uint64_t kNarrow = uint64_t{1} << 28;      // a sixteenth or less
+  const uint32_t addr = width[1] < width[0] ? 1 : 0;
+  const uint32_t port = width[3] < width[2] ? 3 : 2;
+  if (width[addr] < kLongPrefix) return addr;
+  if (width[port] < kNarrow) return port;
+  if (width[addr] < kNarrow) return addr;
+  if (width[4] < kNarrow) return 4;
+  return FW_CLS_TREES;
+}
+
+struct Builder {
+  const Box* boxes;
+  HeapArray<FWClsNode> nodes;
+  HeapArray<uint32_t> leaves;
+  HeapArray<uint32_t> scratch;  // rule lists of the nodes being built, as a stack
+  HeapArray<uint32_t> counts;   // per child, 2^kMaxCutBits + 1
+
+  [[nodiscard]] bool MakeLeaf(uint32_t node, uint32_t off, uint32_t count) {
+    if (!leaves.Reserve(uint64_t{leaves.size} + count)) return false;
+    const uint32_t base = leaves.size;
+    if (count != 0) {
+      zel_Memcpy(leaves.data + base, scratch.data + off, static_cast<size_t>(count) * 4);
+    }
+    leaves.size += count;
+    nodes.data[node] = FWClsNode{base, count, FW_CLS_LEAF, 0, 0};
+    return true;
+  }
+
+  // The children rule `i` meets when dimension d of `reg` is cut into
+  // 2^bits: [*first, *last].
+  void ChildSpan(uint32_t i, const Region& reg, uint32_t d, uint32_t bits, uint32_t* first,
+                 uint32_t* last) const {
+    const uint32_t shift = reg.width[d] - bits;
+    const uint64_t lo = boxes[i].lo[d] > reg.base[d] ? boxes[i].lo[d] : reg.base[d];
+    const uint64_t regHi = RegionHigh(reg, d);
+    const uint64_t hi = boxes[i].hi[d] < regHi ? boxes[i].hi[d] : regHi;
+    *first = static_cast<uint32_t>((lo - reg.base[d]) >> shift);
+    *last = static_cast<uint32_t>((hi - reg.base[d]) >> shift);
+  }
+
+  // The largest child and the copies made by cutting d into 2^bits.
+  void Evaluate(uint32_t off, uint32_t count, const Region& reg, uint32_t d, uint32_t bits,
+                uint32_t* largest, uint64_t* copies) {
+    const uint32_t children = 1u << bits;
+    uint32_t* c = counts.data;
+    zel_Memset(c, 0, (children + 1) * sizeof(uint32_t));
+    uint64_t total = 0;
+    for (uint32_t k = 0; k < count; k++) {
+      uint32_t first, last;
+      ChildSpan(scratch.data[off + k], reg, d, bits, &first, &last);
+      c[first]++;
+      c[last + 1]--;
+      total += last - first + 1;
+    }
+    uint32_t running = 0, most = 0;
+    for (uint32_t j = 0; j < children; j++) {
+      running += c[j];
+      if (running > most) most = running;
+    }
+    *largest = most;
+    *copies = total;
+  }
+
+  // Every rule of the list covers [lo, hi] of dimension d.
+  bool AllCover(uint32_t off, uint32_t count, uint32_t d, uint64_t lo, uint64_t hi) const {
+    for (uint32_t k = 0; k < count; k++) {
+      const Box& b = boxes[scratch.data[off + k]];
+      if (b.lo[d] > lo || b.hi[d] < hi) return false;
+    }
+    return true;
+  }
+
+  // Builds node `node` for the rules scratch[off, off + count) in region
+  // `reg`, spending at most `budget` leaf entries (nodes at kNodeCost) on
+  // the subtree; at least `count`, what a leaf takes. A cut keeps enough
+  // for every child to be a leaf and shares the rest in proportion to the
+  // children's rules, so the bound holds however the tree grows. False
+  // when memory ran out.
+  [[nodiscard]] bool Build(uint32_t node, uint32_t off, uint32_t count, const Region& reg,
+                           uint32_t depth, uint64_t budget) {
+    const FWClassifierTuning& t = g_fwClassifierTuning;
+    if (count <= t.leafSize || depth >= t.maxDepth) {
+      return MakeLeaf(node, off, count);
+    }
+    // The cut that leaves the smallest largest child within the space
+    // factor; fewer copies break ties.
+    uint32_t bestDim = FW_CLS_DIMS, bestBits = 0, bestLargest = count;
+    uint64_t bestCopies = 0;
+    for (uint32_t d = 0; d < FW_CLS_DIMS; d++) {
+      const uint32_t maxBits = reg.width[d] < kMaxCutBits ? reg.width[d] : kMaxCutBits;
+      for (uint32_t bits = 1; bits <= maxBits; bits++) {
+        uint32_t largest;
+        uint64_t copies;
+        Evaluate(off, count, reg, d, bits, &largest, &copies);
+        if (copies + (1u << bits) > kSpaceFactor * count && bits > 1) break;
+        if (largest < bestLargest || (largest == bestLargest && bestDim != FW_CLS_DIMS &&
+                                      copies < bestCopies)) {
+          bestDim = d;
+          bestBits = bits;
+          bestLargest = largest;
+          bestCopies = copies;
+        }
+      }
+    }
+    const uint32_t children = 1u << bestBits;
+    if (bestDim == FW_CLS_DIMS || children * kNodeCost + bestCopies > budget) {
+      return MakeLeaf(node, off, count);
+    }
+    const uint64_t share = budget - children * kNodeCost;
+
+    if (!nodes.Reserve(uint64_t{nodes.size} + children)) return false;
+    const uint32_t childBase = nodes.size;
+    nodes.size += children;
+    const uint32_t d = bestDim;
+    const uint32_t shift = reg.width[d] - bestBits;
+    nodes.data[node] = FWClsNode{childBase, 0, static_cast<uint8_t>(d),
+                                 static_cast<uint8_t>(shift),
+                                 static_cast<uint16_t>(children - 1)};
+
+    Region sub = reg;
+    sub.width[d] = static_cast<uint8_t>(shift);
+    // The previous sibling's list stays on the stack so that an equal list
+    // can share its subtree.
+    uint32_t prevOff = 0, prevCount = 0;
+    bool havePrev = false;
+    for (uint32_t c = 0; c < children; c++) {
+      sub.base[d] = reg.base[d] + static_cast<uint32_t>(uint64_t{c} << shift);
+      const uint64_t subLo = sub.base[d], subHi = RegionHigh(sub, d);
+      const uint32_t curOff = scratch.size;
+      if (!scratch.Reserve(uint64_t{curOff} + count)) return false;
+      for (uint32_t k = 0; k < count; k++) {
+        const uint32_t i = scratch.data[off + k];
+        if (boxes[i].lo[d] <= subHi && boxes[i].hi[d] >= subLo) {
+          scratch.data[scratch.size++] = i;
+        }
+      }
+      const uint32_t curCount = scratch.size - curOff;
+      // Siblings with the same rules, all spanning both siblings on d,
+      // are cut the same way below: one subtree serves both.
+      if (havePrev && prevCount == curCount &&
+          (curCount == 0 ||
+           (zel_Memcmp(scratch.data + prevOff, scratch.data + curOff, curCount * 4) == 0 &&
+            AllCover(curOff, curCount, d, subLo - (uint64_t{1} << shift), subHi)))) {
+        nodes.data[childBase + c] = nodes.data[childBase + c - 1];
+        scratch.size = curOff;
+        continue;
+      }
+      const uint64_t childBudget =
+          bestCopies == 0 ? 0 : share * curCount / bestCopies;
+      if (!Build(childBase + c, curOff, curCount, sub, depth + 1,
+                 childBudget > curCount ? childBudget : curCount)) {
+        return false;
+      }
+      if (havePrev) {
+        // Drop the previous list; the current one becomes previous.
+        // Forward copy to a lower address: safe although the lists may overlap.
+        for (uint32_t k = 0; k < curCount; k++) {
+          scratch.data[prevOff + k] = scratch.data[curOff + k];
+        }
+        scratch.size = prevOff + curCount;
+      } else {
+        prevOff = curOff;
+        havePrev = true;
+      }
+      prevCount = curCount;
+    }
+    scratch.size = off + count;
+    return true;
+  }
+};
+
+}  // namespace
+
+namespace {
+
+// Builds the classifier of `count` rules whose projections fill `boxes`
+// (already filled; released by the caller).
+ZelStatus BuildFromBoxes(Box* boxes, uint32_t count, FWClassifier** classifier) {
+  ZelStatus status = ZEL_NO_MEMORY;
+  {
+    Builder b;
+    b.boxes = boxes;
+    HeapArray<uint32_t> residual;
+    auto* tree = static_cast<uint8_t*>(SLCGenericAlloc(count));
+    bool ok = tree != nullptr && b.counts.Reserve((1u << kMaxCutBits) + 1) &&
+              b.scratch.Reserve(count);
+    uint32_t members[FW_CLS_TREES] = {};
+    for (uint32_t i = 0; ok && i < count; i++) {
+      tree[i] = static_cast<uint8_t>(TreeOf(boxes[i]));
+      if (tree[i] == FW_CLS_TREES) {
+        ok = residual.Push(i);
+      } else {
+        members[tree[i]]++;
+      }
+    }
+    Region root;
+    for (uint32_t d = 0; d < FW_CLS_DIMS; d++) {
+      root.base[d] = 0;
+      root.width[d] = static_cast<uint8_t>(kDimBits[d]);
+    }
+    uint32_t roots[FW_CLS_TREES];
+    for (uint32_t t = 0; t < FW_CLS_TREES; t++) {
+      roots[t] = FW_CLS_NO_TREE;
+      if (!ok || members[t] == 0) continue;
+      b.scratch.size = 0;
+      for (uint32_t i = 0; i < count; i++) {
+        if (tree[i] == t) b.scratch.data[b.scratch.size++] = i;
+      }
+      // Each tree's share of the bound is that of its rules.
+      const uint64_t budget = uint64_t{members[t]} * g_fwClassifierTuning.budgetPerRule;
+      roots[t] = b.nodes.size;
+      ok = b.nodes.Push(FWClsNode{}) &&
+           b.Build(roots[t], 0, b.scratch.size, root, 0,
+                   budget > members[t] ? budget : members[t]);
+    }
+    if (tree != nullptr) SLCGenericFree(tree);
+
+    if (ok) {
+      const uint64_t bytes = sizeof(FWClassifier) + uint64_t{b.nodes.size} * sizeof(FWClsNode) +
+                             (uint64_t{b.leaves.size} + residual.size) * sizeof(uint32_t);
+      void* block = bytes > UINT32_MAX ? nullptr : SLCGenericAlloc(static_cast<uint32_t>(bytes));
+      if (block != nullptr) {
+        auto* c = static_cast<FWClassifier*>(block);
+        auto* nodes = reinterpret_cast<FWClsNode*>(c + 1);
+        auto* leaves = reinterpret_cast<uint32_t*>(nodes + b.nodes.size);
+        auto* rest = leaves + b.leaves.size;
+        zel_Memcpy(nodes, b.nodes.data, static_cast<size_t>(b.nodes.size) * sizeof(FWClsNode));
+        if (b.leaves.size != 0) {
+          zel_Memcpy(leaves, b.leaves.data, static_cast<size_t>(b.leaves.size) * 4);
+        }
+        if (residual.size != 0) {
+          zel_Memcpy(rest, residual.data, static_cast<size_t>(residual.size) * 4);
+        }
+        for (uint32_t t = 0; t < FW_CLS_TREES; t++) c->roots[t] = roots[t];
+        c->numRules = count;
+        c->numNodes = b.nodes.size;
+        c->numLeafSlots = b.leaves.size;
+        c->numResidual = residual.size;
+        c->bytes = static_cast<uint32_t>(bytes);
+        c->nodes = nodes;
+        c->leaves = leaves;
+        c->residual = rest;
+        *classifier = c;
+        status = ZEL_OK;
+      }
+    }
+  }
+  return status;
+}
+
+// The rules' projections, in a block of the module heap; null when it
+// cannot be had.
+Box* AllocBoxes(uint32_t count) {
+  const uint64_t bytes = uint64_t{count} * sizeof(Box);
+  if (count == 0 || bytes > UINT32_MAX) return nullptr;
+  return static_cast<Box*>(SLCGenericAlloc(static_cast<uint32_t>(bytes)));
+}
+
+}  // namespace
+
+ZelStatus FWClassifierBuild(FWRuleEntry* const* entries, uint32_t count,
+                            FWClassifier** classifier) {
+  *classifier = nullptr;
+  if (count < g_fwClassifierTuning.minRules || count == 0) return ZEL_OK;
+  Box* boxes = AllocBoxes(count);
+  if (boxes == nullptr) return ZEL_NO_MEMORY;
+  for (uint32_t i = 0; i < count; i++) Project(entries[i]->rule, &boxes[i]);
+  const ZelStatus status = BuildFromBoxes(boxes, count, classifier);
+  SLCGenericFree(boxes);
+  return status;
+}
+
+ZelStatus FWClassifierPrepare(FWRuleset* ruleset, FWClassifier** classifier) {
+  *classifier = nullptr;
+  const uint32_t version = ruleset->version;
+  if (version != FW_RULESET_VERSION_7 && version != FW_RULESET_VERSION_8) return ZEL_OK;
+  const uint32_t records = ruleset->numRules;
+  if (records < g_fwClassifierTuning.minRules) return ZEL_OK;
+  Box* boxes = AllocBoxes(records);
+  if (boxes == nullptr) return ZEL_NO_MEMORY;
+  // The general records, in ruleset order, as the application installs
+  // them: the slots of a replacing application's index.
+  uint32_t count = 0;
+  for (uint32_t i = 0; i < records; i++) {
+    uint64_t size = 0;
+    const uint8_t* record = FWGetRuleFromRuleset(version, ruleset, i, &size);
+    FWRule work;
+    zel_Memset(&work, 0, sizeof(work));
+    zel_Memcpy(&work, record, size);
+    FWUpdateWildcardsToCurrent(version, &work);
+    if (work.ruleFlags & FW_GENERAL_RULE_MASK) Project(work, &boxes[count++]);
+  }
+  ZelStatus status = ZEL_OK;
+  if (count >= g_fwClassifierTuning.minRules) status = BuildFromBoxes(boxes, count, classifier);
+  SLCGenericFree(boxes);
+  return status;
+}
+
+void FWClassifierFree(FWClassifier** classifier) {
+  if (*classifier != nullptr) {
+    SLCGenericFree(*classifier);
+    *classifier = nullptr;
+  }
+}

@@ -1,0 +1,124 @@
+// The compiled classifier of the general rules: decision trees over five
+// numeric fields that narrow the scan index (fw_index.h) to a few
+// candidate slots per packet, plus a residual list of the rules no tree
+// can separate.
+//
+// The ordered scan stays the definition. The tree only ever leaves out
+// slots that would miss: each rule is projected on five dimensions, every
+// projection an inclusive interval of 32-bit numbers that contains every
+// value of a packet the rule can match:
+//   0, 1  source, destination address: the IPv4 address, or the leading 32
+//         bits of an IPv6 address (both families share the dimension; a
+//         candidate of the wrong family is rejected by its slot);
+//   2, 3  source, destination port;
+//   4     IP protocol.
+// A field the rule does not compare, negates, or (ports of a rule that
+// compares the resource-pool tag) must not reject before the tag is read,
+// projects on the whole dimension. A packet lacking a field presents 0 for
+// it: every rule comparing the field requires its presence and misses
+// anyway, and every other rule spans the whole dimension.
+//
+// Each rule goes to the tree of the dimension that separates it best (a
+// long address prefix, else a port, else a shorter address, else the
+// protocol), so that rules wide on one address do not get copied across
+// every cut of a tree built on it. A node cuts an aligned power-of-two
+// block of one dimension into 2^bits equal children; a rule goes to every
+// child its projection meets, in ruleset order, so a leaf lists slot
+// numbers in ascending order. Rules wide on every dimension would be
+// copied into most leaves: they form the residual list instead, also
+// ascending. A lookup merges the leaf of every tree and the residual list
+// in ascending order, tests each slot (and the full test when the slot
+// says so) and stops at the first match: the same rule, with the same
+// tests run in the same order up to it, as the ordered scan.
+//
+// Memory comes from the module heap and is bounded per rule: when the
+// bound would be passed, nodes stop being cut and their leaves just get
+// longer. The build keeps one block: header, nodes, leaf lists, residual
+// list.
+#pragma once
+
+#include "firewall/fw_rules.h"
+
+inline constexpr uint32_t FW_CLS_DIMS = 5;
+
+struct FWClsNode {
+  uint32_t base;   // internal: first child node; leaf: first slot number in leaves
+  uint32_t count;  // leaf: slot numbers listed
+  uint8_t dim;     // FW_CLS_LEAF for a leaf
+  uint8_t shift;   // child = (value >> shift) & mask
+  uint16_t mask;
+};
+static_assert(sizeof(FWClsNode) == 12);
+inline constexpr uint8_t FW_CLS_LEAF = 0xff;
+
+inline constexpr uint32_t FW_CLS_TREES = FW_CLS_DIMS;
+inline constexpr uint32_t FW_CLS_NO_TREE = 0xffffffffu;
+
+struct FWClassifier {
+  uint32_t roots[FW_CLS_TREES];  // node number of each tree's root, or FW_CLS_NO_TREE
+  uint32_t numRules;             // slots it was built for
+  uint32_t numNodes;
+  uint32_t numLeafSlots;
+  uint32_t numResidual;
+  uint32_t bytes;          // the whole block, for accounting
+  const FWClsNode* nodes;  // inside this block
+  const uint32_t* leaves;  // inside this block
+  const uint32_t* residual;  // inside this block
+};
+
+// Build limits. Rulesets smaller than minRules are scanned in order; a
+// node with at most leafSize rules is a leaf; the tree holds at most
+// budgetPerRule 4-byte words (leaf entries; a node takes three) per rule.
+// Tests lower them to exercise deep trees on small rulesets.
+struct FWClassifierTuning {
+  uint32_t minRules;
+  uint32_t leafSize;
+  uint32_t maxDepth;
+  uint32_t budgetPerRule;
+};
+extern FWClassifierTuning g_fwClassifierTuning;
+inline constexpr FWClassifierTuning kFWClassifierDefaults = {24, 16, 24, 256};
+
+struct FWScanSlot;
+struct FWRuleEntry;
+
+// Builds the classifier of `count` slots (entries[i] belongs to slot i).
+// Null and ZEL_OK when the ruleset is too small to gain from one.
+// ZEL_NO_MEMORY when an allocation fails; nothing is then allocated.
+[[nodiscard]] ZelStatus FWClassifierBuild(FWRuleEntry* const* entries, uint32_t count,
+                                          FWClassifier** classifier);
+void FWClassifierFree(FWClassifier** classifier);
+
+// Builds, from a ruleset about to replace a filter's rules, the classifier
+// its application would build: the general records, in order, widened as
+// installed. Needs no lock (it reads only the ruleset, whose length the
+// caller has checked), so the build happens before the exclusive hold.
+// Null and ZEL_OK when none would be built; ZEL_NO_MEMORY when an
+// allocation fails (nothing is then allocated).
+[[nodiscard]] ZelStatus FWClassifierPrepare(FWRuleset* ruleset, FWClassifier** classifier);
+
+// FWApplyRuleset with the classifier FWClassifierPrepare made of the same
+// ruleset (or null), configLock held exclusively. Takes `prepared` over
+// whatever happens: a replacing application installs it in place of
+// building one, anything else frees it.
+[[nodiscard]] ZelStatus FWApplyPreparedRuleset(SLCGenericFilter* filter, FWRuleset* ruleset,
+                                               uint32_t replace, uint32_t fromIoctl,
+                                               FWClassifier* prepared);
+
+// The packet's value on every dimension.
+struct FWClsKey {
+  uint32_t v[FW_CLS_DIMS];
+};
+
+// The leaf of `key` in the tree rooted at node `root`: its first slot
+// number and count.
+inline const uint32_t* FWClassifierLeaf(const FWClassifier* c, uint32_t root,
+                                        const FWClsKey& key, uint32_t* count) {
+  const FWClsNode* nodes = c->nodes;
+  const FWClsNode* n = nodes + root;
+  while (n->dim != FW_CLS_LEAF) {
+    n = &nodes[n->base + ((key.v[n->dim] >> n->shift) & n->mask)];
+  }
+  *count = n->count;
+  return c->leaves + n->base;
+}

@@ -1,0 +1,390 @@
+// The compiled classifier of the general rules against the reference model
+// (the ordered first-match scan written from the rule semantics), and its
+// build under allocation failure.
+//
+// The build limits are lowered so that small rulesets get deep trees, long
+// residual lists and the memory bound; rules and packets are drawn from
+// pools of prefixes, ranges and values that overlap a lot, in both
+// families, with negations, masked MACs, 802.1Q tags, pool tags, version-7
+// records, add sequences and single-rule removals.
+#include <gtest/gtest.h>
+
+#include <arpa/inet.h>
+
+#include <cstring>
+#include <random>
+#include <tuple>
+#include <vector>
+#include <string>
+
+#include "firewall/fw_classifier.h"
+#include "firewall/fw_index.h"
+#include "firewall/fw_ioctl.h"
+#include "host/core/faults.h"
+#include "tests/support/fw_fixture.h"
+#include "tools/lib/ruleset_builder.h"
+
+namespace {
+
+using testsupport::FirewallTest;
+using testsupport::FwModel;
+using testsupport::ModelPacket;
+
+class Gen {
+ public:
+  explicit Gen(uint32_t seed) : rng_(seed) {}
+
+  uint32_t U(uint32_t n) { return rng_() % n; }
+  bool P(int percent) { return static_cast<int>(U(100)) < percent; }
+
+  // Addresses inside 10.0.0.0/22 (IPv4) or 2001:db8:X::/48 with X < 4 and
+  // a small interface part (IPv6), so that prefixes and ranges overlap.
+  void Addr(bool v4, uint8_t out[16]) {
+    std::memset(out, 0, 16);
+    if (v4) {
+      const uint32_t a = 0x0a000000u | U(1024);
+      out[0] = a >> 24;
+      out[1] = a >> 16;
+      out[2] = a >> 8;
+      out[3] = a;
+    } else {
+      out[0] = 0x20;
+      out[1] = 0x01;
+      out[2] = 0x0d;
+      out[3] = 0xb8;
+      out[5] = static_cast<uint8_t>(U(4));
+      out[15] = static_cast<uint8_t>(U(16));
+    }
+  }
+  // A range [lo, hi] around lo (IPv4 inclusive, IPv6 exclusive: the rule's
+  // own business), sometimes empty, sometimes a prefix.
+  void AddrRange(bool v4, uint8_t lo[16], uint8_t hi[16]) {
+    Addr(v4, lo);
+    std::memcpy(hi, lo, 16);
+    if (v4) {
+      uint32_t l = FWNet32(lo);
+      if (P(50)) l &= ~0u << U(10);  // a prefix
+      uint32_t h = P(5) ? l - 1 : l + U(300);
+      const uint32_t ln = htonl(l), hn = htonl(h);
+      std::memcpy(lo, &ln, 4);
+      std::memcpy(hi, &hn, 4);
+    } else {
+      hi[5] = static_cast<uint8_t>(lo[5] + U(2));
+      hi[15] = static_cast<uint8_t>(U(16));
+    }
+  }
+  uint16_t PortValue() {
+    static const uint16_t kPorts[] = {53, 80, 443, 1000, 1001, 8080, 65535, 0};
+    return P(70) ? kPorts[U(8)] : static_cast<uint16_t>(U(65536));
+  }
+
+  FWRule Rule(uint8_t version, uint64_t id) {
+    static const uint8_t kMacs[3][6] = {
+        {2, 0, 0, 0, 0, 1}, {2, 0, 0, 0, 0, 2}, {2, 0x11, 0x22, 0x33, 0x44, 0x55}};
+    static const uint8_t kMasks[3][6] = {
+        {0xff, 0xff, 0xff, 0, 0, 0}, {0xff, 0, 0, 0, 0, 0xff}, {}};
+    FWRule r;
+    std::memset(&r, 0, sizeof(r));
+    r.action = 1 + U(3);
+    r.direction = P(3) ? 0 : static_cast<uint8_t>(1 + U(3));
+    r.bidirectional = static_cast<uint8_t>(U(3));
+    r.pktCount = id;  // tells rules apart
+    const bool v4 = P(60);
+    // Start from "compares nothing" and add fields.
+    r.ruleFlags = FW_WC_FIELDS | (v4 ? FW_FLAG_IPV4 : 0);
+    if (P(60)) r.ruleFlags |= FW_WC_RPTAG; else r.rpTag = static_cast<uint16_t>(U(3));
+    auto field = [&](uint32_t wc, int percent) {
+      if (!P(percent)) return false;
+      r.ruleFlags &= ~wc;
+      return true;
+    };
+    if (field(FW_WC_IPSA, 60)) {
+      if (P(40)) {
+        r.ruleFlags |= FW_RANGE_IPSA;
+        AddrRange(v4, r.ipSa, r.ipSaHigh);
+      } else {
+        Addr(v4, r.ipSa);
+      }
+    }
+    if (field(FW_WC_IPDA, 60)) {
+      if (P(40)) {
+        r.ruleFlags |= FW_RANGE_IPDA;
+        AddrRange(v4, r.ipDa, r.ipDaHigh);
+      } else {
+        Addr(v4, r.ipDa);
+      }
+    }
+    if (field(FW_WC_IPPROTO, 60)) r.ipProto = P(90) ? (P(50) ? 6 : 17) : 1;
+    for (auto [wc, range, lo, hi] : {std::tuple{FW_WC_SPORT, FW_RANGE_SPORT, r.sPort, r.sPortHigh},
+                                     std::tuple{FW_WC_DPORT, FW_RANGE_DPORT, r.dPort, r.dPortHigh}}) {
+      if (!field(wc, 50)) continue;
+      const uint16_t l = PortValue();
+      FWPutNet16(lo, l);
+      if (P(40)) {
+        r.ruleFlags |= range;
+        FWPutNet16(hi, P(5) ? static_cast<uint16_t>(l - 1) : static_cast<uint16_t>(l + U(2000)));
+      }
+    }
+    if (field(FW_WC_DMAC, 10)) {
+      std::memcpy(r.dMac, kMacs[U(3)], 6);
+      if (P(50)) {
+        r.ruleFlags |= FW_MASK_DMAC;
+        std::memcpy(r.dMacMask, kMasks[U(3)], 6);
+      }
+    }
+    if (field(FW_WC_SMAC, 10)) std::memcpy(r.sMac, kMacs[U(3)], 6);
+    if (field(FW_WC_ETHTYPE, 10)) FWPutNet16(r.ethType, P(50) ? 0x0800 : 0x86dd);
+    if (field(FW_WC_VLAN, 10)) r.vlan1QTag[0] = 0x81, r.vlan1QTag[3] = static_cast<uint8_t>(U(2));
+    for (uint32_t bit = 0; bit < 9; bit++) {
+      if (P(4)) r.negateFlags |= 1u << bit;
+    }
+    if ((r.ruleFlags & FW_GENERAL_RULE_MASK) == 0) r.ruleFlags |= FW_WC_VLAN;  // keep it general
+    if (version == 7) std::memset(reinterpret_cast<uint8_t*>(&r) + 259, 0, 281 - 259);
+    return r;
+  }
+
+  // Half the packets inside a random rule's ranges, half from the pools.
+  ModelPacket Packet(const FwModel& model) {
+    ModelPacket p;
+    p.presence |= FW_PKT_L2;
+    p.dMac[0] = 2;
+    p.dMac[5] = static_cast<uint8_t>(1 + U(2));
+    p.sMac[0] = 2;
+    p.sMac[5] = static_cast<uint8_t>(1 + U(2));
+    if (P(20)) p.vlan1QTag[0] = 0x81, p.vlan1QTag[3] = static_cast<uint8_t>(U(2));
+    if (P(5)) return p;  // not IP
+    const FWRule* inside = nullptr;
+    if (!model.General().empty() && P(50)) {
+      inside = &model.General()[U(static_cast<uint32_t>(model.General().size()))];
+    }
+    const bool v4 = inside ? (inside->ruleFlags & FW_FLAG_IPV4) != 0 : P(60);
+    FWPutNet16(p.ethType, v4 ? 0x0800 : 0x86dd);
+    p.presence |= FW_PKT_L3 | (v4 ? FW_PKT_IPV4 : FW_PKT_IPV6);
+    Addr(v4, p.ipSa);
+    Addr(v4, p.ipDa);
+    p.ipProto = P(45) ? 6 : P(80) ? 17 : 1;
+    FWPutNet16(p.sPort, PortValue());
+    FWPutNet16(p.dPort, PortValue());
+    if (inside != nullptr) {
+      const uint32_t f = inside->ruleFlags;
+      if (!(f & FW_WC_IPSA)) Pick(inside->ipSa, inside->ipSaHigh, f & FW_RANGE_IPSA, v4, p.ipSa);
+      if (!(f & FW_WC_IPDA)) Pick(inside->ipDa, inside->ipDaHigh, f & FW_RANGE_IPDA, v4, p.ipDa);
+      if (!(f & FW_WC_IPPROTO)) p.ipProto = inside->ipProto;
+      if (!(f & FW_WC_SPORT)) PickPort(inside->sPort, inside->sPortHigh, f & FW_RANGE_SPORT, p.sPort);
+      if (!(f & FW_WC_DPORT)) PickPort(inside->dPort, inside->dPortHigh, f & FW_RANGE_DPORT, p.dPort);
+    }
+    if ((p.ipProto == 6 || p.ipProto == 17) && P(90)) {
+      p.presence |= FW_PKT_PORTS | (p.ipProto == 17 ? FW_PKT_UDP : FW_PKT_TCP);
+    }
+    return p;
+  }
+
+ private:
+  void Pick(const uint8_t* lo, const uint8_t* hi, bool range, bool v4, uint8_t* out) {
+    std::memcpy(out, lo, v4 ? 4 : 16);
+    if (!range) return;
+    if (v4) {
+      const uint32_t l = FWNet32(lo), h = FWNet32(hi);
+      const uint32_t v = htonl(l <= h ? l + U(h - l + 1) : l);
+      std::memcpy(out, &v, 4);
+    } else if (P(50)) {
+      std::memcpy(out, hi, 16);  // the excluded upper end
+    }
+  }
+  void PickPort(const uint8_t* lo, const uint8_t* hi, bool range, uint8_t* out) {
+    std::memcpy(out, lo, 2);
+    const uint32_t l = FWNet16(lo), h = FWNet16(hi);
+    if (range && l <= h) FWPutNet16(out, static_cast<uint16_t>(l + U(h - l + 1)));
+  }
+
+  std::mt19937 rng_;
+};
+
+class ClassifierTest : public FirewallTest {
+ protected:
+  void TearDown() override {
+    g_fwClassifierTuning = kFWClassifierDefaults;
+    FirewallTest::TearDown();
+  }
+
+  // Every packet gets the model's rule; returns packets checked.
+  void ExpectSameAsModel(Gen& gen, const FwModel& model, uint32_t iter, uint32_t packets) {
+    for (uint32_t k = 0; k < packets; k++) {
+      const ModelPacket p = gen.Packet(model);
+      const uint32_t dir = 1 + gen.U(2);
+      const uint16_t tag = static_cast<uint16_t>(gen.U(3));
+      const FWRuleEntry* got = Lookup(p, dir, tag);
+      const auto want = model.Match(p.Summary(), dir, tag);
+      checked_++;
+      hits_ += want.has_value();
+      if (static_cast<bool>(got) != want.has_value() ||
+          (got && !testsupport::SameRecord(got->rule, *want))) {
+        ADD_FAILURE() << "iteration " << iter << " packet " << k << " dir " << dir << " tag "
+                      << tag << " presence 0x" << std::hex << p.presence << std::dec
+                      << "\n  module: " << (got ? rules::FormatRule(got->rule) : "none")
+                      << "\n  model:  " << (want ? rules::FormatRule(*want) : "none");
+        return;
+      }
+    }
+  }
+
+  void Remove(const FWRule& rule) {
+    std::vector<uint8_t> msg(8);
+    const uint32_t head[2] = {FWIoctlMsgClear, FWClearMethodRemove};
+    std::memcpy(msg.data(), head, sizeof(head));
+    const auto rs = rules::RulesetBuilder(8).Add(rule).Bytes();
+    msg.insert(msg.end(), rs.begin(), rs.end());
+    FWFilterIoctlRequest(filter_, 7, msg.data(), msg.size());
+  }
+
+  uint64_t checked_ = 0, hits_ = 0;
+};
+
+TEST_F(ClassifierTest, SameRuleAsTheOrderedScanForEveryPacket) {
+  uint64_t id = 1, built = 0, residual = 0, prepared = 0;
+  for (uint32_t iter = 0; iter < 400; iter++) {
+    Gen gen(0xc1a55000u + iter);
+    // Leaves of 1 to 8 rules, and now and then a budget that stops the
+    // cutting early.
+    g_fwClassifierTuning = {1, 1 + gen.U(8), 1 + gen.U(24), gen.P(20) ? 1u + gen.U(4) : 64u};
+    FwModel model;
+    const uint32_t applications = 1 + gen.U(3);
+    for (uint32_t a = 0; a < applications; a++) {
+      const uint8_t version = gen.P(25) ? 7 : 8;
+      rules::RulesetBuilder b(version);
+      const uint32_t n = 1 + gen.U(a == 0 ? 300 : 60);
+      for (uint32_t i = 0; i < n; i++) b.Add(gen.Rule(version, id++));
+      const auto rs = b.Bytes();
+      if (a == 0 && gen.P(50)) {
+        // The control channel's road: the classifier built before the
+        // exclusive hold.
+        std::vector<uint8_t> copy(rs);
+        ASSERT_EQ(FWSetIoctlRuleset(filter_, reinterpret_cast<FWRuleset*>(copy.data()), 1),
+                  ZEL_OK);
+        prepared++;
+      } else {
+        ASSERT_EQ(Apply(rs, a == 0), ZEL_OK);
+      }
+      model.Apply(rs, a == 0);
+    }
+    ASSERT_NE(ctx_->scanIndex, nullptr);
+    ASSERT_NE(ctx_->scanIndex->classifier, nullptr);
+    built++;
+    residual += ctx_->scanIndex->classifier->numResidual;
+    ExpectSameAsModel(gen, model, iter, 300);
+    if (HasFailure()) return;
+
+    // Remove a few rules one by one. The reference is the model of the
+    // rules left in the list, in order (which of several equal rules a
+    // removal picks is the removal's business).
+    std::vector<FWRule> left = model.General();
+    for (uint32_t r = 0; r < 3 && left.size() > 1; r++) {
+      Remove(left[gen.U(static_cast<uint32_t>(left.size()))]);
+    }
+    left.clear();
+    for (const FWRuleEntry* e : GeneralEntries()) left.push_back(e->rule);
+    ASSERT_LT(left.size(), model.General().size()) << "iteration " << iter;
+    FwModel after;
+    rules::RulesetBuilder b(8);
+    for (const FWRule& r : left) b.Add(r);
+    after.Apply(b.Bytes(), true);
+    ExpectSameAsModel(gen, after, iter, 100);
+    if (HasFailure()) return;
+  }
+  EXPECT_EQ(built, 400u);
+  EXPECT_GT(prepared, 100u);
+  EXPECT_GT(residual, 0u);
+  EXPECT_GT(hits_, checked_ / 3);
+  RecordProperty("hits", std::to_string(hits_) + "/" + std::to_string(checked_));
+}
+
+// Default limits on a larger ruleset, so the shipped configuration is
+// checked too.
+TEST_F(ClassifierTest, DefaultLimitsOnThousandsOfRules) {
+  Gen gen(0xc1a5f00d);
+  FwModel model;
+  rules::RulesetBuilder b(8);
+  for (uint64_t i = 0; i < 3000; i++) b.Add(gen.Rule(8, i + 1));
+  const auto rs = b.Bytes();
+  ASSERT_EQ(Apply(rs, true), ZEL_OK);
+  model.Apply(rs, true);
+  ASSERT_NE(ctx_->scanIndex->classifier, nullptr);
+  EXPECT_LT(ctx_->scanIndex->classifier->bytes, 3000u * 2048);
+  ExpectSameAsModel(gen, model, 0, 20000);
+}
+
+// An allocation failed anywhere in the classifier's build undoes the whole
+// application, in replace and in add mode: the filter as it was, nothing
+// leaked; the next attempt succeeds.
+TEST_F(ClassifierTest, AllocationFailureAnywhereInTheBuildChangesNothing) {
+  g_fwClassifierTuning = {1, 2, 24, 64};
+  Gen gen(0xfa11);
+  rules::RulesetBuilder first(8), next(8);
+  for (uint64_t i = 0; i < 150; i++) first.Add(gen.Rule(8, i + 1));
+  for (uint64_t i = 0; i < 150; i++) next.Add(gen.Rule(8, 1000 + i));
+  ASSERT_EQ(Apply(first.Bytes(), true), ZEL_OK);
+  const auto rs = next.Bytes();
+  for (const bool replace : {true, false}) {
+    const Fingerprint before = Capture();
+    uint64_t failures = 0;
+    for (uint64_t n = 1;; n++) {
+      host::Faults::Fail("zel_HeapAllocWithRA", ZEL_NO_MEMORY, n);
+      const ZelStatus status = Apply(rs, replace);
+      const bool injected = host::Faults::Injected("zel_HeapAllocWithRA") > 0;
+      host::Faults::ClearAll();
+      if (!injected) {
+        EXPECT_EQ(status, ZEL_OK);
+        break;
+      }
+      failures++;
+      ASSERT_EQ(status, ZEL_FAILURE) << "allocation " << n;
+      ASSERT_TRUE(Capture() == before) << "allocation " << n << " changed the filter";
+    }
+    // Every rule record, the index, and the classifier's own blocks
+    // (growing arrays included) were each failed once.
+    EXPECT_GT(failures, 150u + 5u) << (replace ? "replace" : "add");
+    FwModel model;
+    model.Apply(first.Bytes(), true);
+    model.Apply(rs, replace);
+    ExpectSameAsModel(gen, model, 0, 2000);
+    ASSERT_EQ(Apply(first.Bytes(), true), ZEL_OK);
+  }
+}
+
+// The control channel's road prepares the classifier before the hold: an
+// allocation failed there only moves the build under the hold; failed
+// anywhere else, the filter stays as it was. Either way nothing leaks.
+TEST_F(ClassifierTest, PreparedBeforeTheHoldUnderAllocationFailure) {
+  g_fwClassifierTuning = {1, 2, 24, 64};
+  Gen gen(0xbefe);
+  rules::RulesetBuilder first(8), next(8);
+  for (uint64_t i = 0; i < 80; i++) first.Add(gen.Rule(8, i + 1));
+  for (uint64_t i = 0; i < 80; i++) next.Add(gen.Rule(8, 1000 + i));
+  ASSERT_EQ(Apply(first.Bytes(), true), ZEL_OK);
+  FwModel model;
+  model.Apply(next.Bytes(), true);
+  uint64_t succeeded = 0;
+  for (uint64_t n = 1;; n++) {
+    const Fingerprint before = Capture();
+    std::vector<uint8_t> copy = next.Bytes();
+    host::Faults::Fail("zel_HeapAllocWithRA", ZEL_NO_MEMORY, n);
+    const ZelStatus status =
+        FWSetIoctlRuleset(filter_, reinterpret_cast<FWRuleset*>(copy.data()), 1);
+    const bool injected = host::Faults::Injected("zel_HeapAllocWithRA") > 0;
+    host::Faults::ClearAll();
+    if (status == ZEL_OK) {
+      succeeded++;
+      ASSERT_NE(ctx_->scanIndex->classifier, nullptr);
+      ExpectSameAsModel(gen, model, static_cast<uint32_t>(n), 300);
+      if (!injected) break;
+      ASSERT_EQ(Apply(first.Bytes(), true), ZEL_OK);
+      EXPECT_EQ(Capture().heapBlocks, before.heapBlocks) << "allocation " << n;
+    } else {
+      ASSERT_TRUE(Capture() == before) << "allocation " << n << " changed the filter";
+    }
+  }
+  // Failures inside the preparation were absorbed by the build under the hold.
+  EXPECT_GT(succeeded, 1u);
+}
+
+}  // namespace
