@@ -5,6 +5,7 @@
 # draws from it.
 set -euo pipefail
 cd "$(dirname "$0")/.."
+bash scripts/install-deps.sh bench
 out=bench/results
 mkdir -p "$out"
 json=${1:-}
