@@ -304,24 +304,6 @@ void FWApplyAction(FWWalk* walk, ZelPkt* pkt, uint32_t action, FWRuleEntry* entr
   zel_PktListIterMove(walk->iter);
 }
 
-// The fragment override decides with no rule. Actions that take their
-// parameters from a rule (L2 rewrite, GRE, pool tag, DSCP and 802.1p marks)
-// have nothing to work with there, so an override naming one of them lets
-// fragments pass unchanged, as Accept would.
-inline uint32_t FWOverrideAction(uint32_t fragOverride) {
-  switch (fragOverride) {
-    case SLGenericActionL2Rewrite:
-    case SLCGenericActionGRE:
-    case SLCGenericActionResourcePoolTag:
-    case SLCGenericActionDSCPMark:
-    case SLCGenericActionEthDot1PMark:
-    case SLCGenericActionDSCPMarkAndEthDot1PMark:
-      return SLCGenericActionAccept;
-    default:
-      return fragOverride;
-  }
-}
-
 // Two shapes of the walk share the parse and the verdict below.
 //
 // Direct: each packet is parsed and decided in turn. Used while the exact

@@ -53,6 +53,25 @@ inline const uint8_t* FWEthernetParse(const uint8_t* frame, uint32_t* l3) {
   return frame + 12;
 }
 
+// The action a fragment override carries out. The override decides with no
+// rule, so actions that take their parameters from a rule (L2 rewrite, GRE,
+// pool tag, DSCP and 802.1p marks) have nothing to work with there: an
+// override naming one of them lets fragments pass unchanged, as Accept
+// would.
+inline uint32_t FWOverrideAction(uint32_t fragOverride) {
+  switch (fragOverride) {
+    case SLGenericActionL2Rewrite:
+    case SLCGenericActionGRE:
+    case SLCGenericActionResourcePoolTag:
+    case SLCGenericActionDSCPMark:
+    case SLCGenericActionEthDot1PMark:
+    case SLCGenericActionDSCPMarkAndEthDot1PMark:
+      return SLCGenericActionAccept;
+    default:
+      return fragOverride;
+  }
+}
+
 // Parses one packet into `summary` as the walk does (presence, fields and
 // vlan1QTag all set afresh). `fragOverride` is the context's: a first
 // fragment gets no ports while it is not 0.
