@@ -14,6 +14,7 @@ have_pkg libgtest-dev || need+=(libgtest-dev)
 have_pkg libgmock-dev || need+=(libgmock-dev)
 have_pkg libbenchmark-dev || need+=(libbenchmark-dev)
 have_cmd valgrind || need+=(valgrind)
+have_pkg libcli11-dev || need+=(libcli11-dev)
 
 if [ ${#need[@]} -eq 0 ]; then
   exit 0

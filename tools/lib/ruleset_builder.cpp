@@ -138,28 +138,34 @@ std::string Hex(T v) {
   return buf;
 }
 
+// Edits between two words, a swap of neighbours counting as one.
 size_t EditDistance(std::string_view a, std::string_view b) {
   if (a.size() > 32 || b.size() > 32) return 99;
   size_t d[33][33];
   for (size_t i = 0; i <= a.size(); i++) d[i][0] = i;
   for (size_t j = 0; j <= b.size(); j++) d[0][j] = j;
+  auto low = [](char c) { return std::tolower(static_cast<unsigned char>(c)); };
   for (size_t i = 1; i <= a.size(); i++) {
     for (size_t j = 1; j <= b.size(); j++) {
-      const size_t sub = d[i - 1][j - 1] + (std::tolower(a[i - 1]) == std::tolower(b[j - 1]) ? 0 : 1);
-      d[i][j] = std::min({d[i - 1][j] + 1, d[i][j - 1] + 1, sub});
+      d[i][j] = std::min({d[i - 1][j] + 1, d[i][j - 1] + 1,
+                          d[i - 1][j - 1] + (low(a[i - 1]) == low(b[j - 1]) ? 0 : 1)});
+      if (i > 1 && j > 1 && low(a[i - 1]) == low(b[j - 2]) && low(a[i - 2]) == low(b[j - 1])) {
+        d[i][j] = std::min(d[i][j], d[i - 2][j - 2] + 1);
+      }
     }
   }
   return d[a.size()][b.size()];
 }
 
-// "; did you mean 'x'?" for the closest name within two edits, or "".
+// "; did you mean 'x'?" for the closest name within reach (one edit for
+// short words, two for longer ones), or "".
 template <typename Names>
 std::string DidYouMean(std::string_view word, const Names& names) {
   std::string best;
-  size_t bestDist = 3;
+  size_t bestDist = word.size() <= 4 ? 2 : 3;
   for (const auto& n : names) {
     const size_t d = EditDistance(word, n);
-    if (d < bestDist) {
+    if (d < bestDist && d < std::string_view(n).size()) {
       bestDist = d;
       best = n;
     }
@@ -718,15 +724,17 @@ std::optional<TextRule> ReadRuleLine(const std::vector<Token>& tokens, uint8_t v
       rep.At(t, std::string(key) + " needs a value (" + std::string(key) + "=...)");
       continue;
     }
-    if (v7 && (key == "rptag" || key == "dscp" || key == "dot1p")) {
+    // Version-7 records have no bytes for these; `raw` leaves the refusal
+    // to the builder, which accepts them only when they write zero bytes.
+    if (v7 && !raw && (key == "rptag" || key == "dscp" || key == "dot1p")) {
       rep.At(t, std::string(key) + " is a version-8 field; this ruleset is version 7");
       continue;
     }
-    if (v7 && !value.empty() && value[0] == '!') {
+    if (v7 && !raw && !value.empty() && value[0] == '!') {
       rep.AtValue(t, "negation ('!') needs a version-8 ruleset; this one is version 7");
       continue;
     }
-    if (v7 && (key == "dmac" || key == "smac") && value.find('/') != std::string_view::npos) {
+    if (v7 && !raw && (key == "dmac" || key == "smac") && value.find('/') != std::string_view::npos) {
       rep.AtValue(t, "MAC masks need a version-8 ruleset; this one is version 7");
       continue;
     }
@@ -983,8 +991,19 @@ RulesetText ReadRulesetText(std::string_view text) {
                   found = true;
                 }
               }
-              if (!found && raw && !name.empty() && std::isdigit(static_cast<unsigned char>(name[0]))) {
-                bits |= static_cast<uint32_t>(ParseNumber("features", name, 0xffffffffu));
+              if (!found && !name.empty() && std::isdigit(static_cast<unsigned char>(name[0]))) {
+                // Numbers are read for the known bits; others need `raw`
+                // because the module ignores them.
+                const uint32_t n = static_cast<uint32_t>(ParseNumber("features", name, 0xffffffffu));
+                const uint32_t known = FW_FEATURE_DROP_BPDU | FW_FEATURE_DROP_DHCP_SERVER;
+                if ((n & ~known) && !raw) {
+                  rep.AtValue(t, "features " + Quote(name) + " sets bits the module ignores (" +
+                                     Hex(n & ~known) + ")",
+                              "features: drop-bpdu (0x1) drop-dhcp-server (0x2); 'raw' in the header allows others");
+                  ok = false;
+                  break;
+                }
+                bits |= n;
                 found = true;
               }
               if (!found) {
