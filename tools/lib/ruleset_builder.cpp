@@ -36,10 +36,10 @@ struct FeatureName {
 constexpr std::array<FeatureName, 2> kFeatureNames = {
     {{"drop-bpdu", FW_FEATURE_DROP_BPDU}, {"drop-dhcp-server", FW_FEATURE_DROP_DHCP_SERVER}}};
 
-constexpr std::array<const char*, 27> kRuleKeys = {
+constexpr std::array<const char*, 28> kRuleKeys = {
     "action", "dir",  "ipv4",    "ipv6",  "dmac",   "smac",     "ethtype", "vlan",  "sa",
     "da",     "proto", "sport",  "dport", "rptag",  "bidir",    "rewrite", "gre",   "snaplen",
-    "pool",   "dot1p", "dscp",   "pkts",  "bytes",  "rawflags", "rawneg",  "exact", "raw"};
+    "pool",   "dot1p", "dscp",   "pkts",  "bytes",  "rawflags", "rawneg",  "exact", "raw", "wire"};
 
 [[noreturn]] void Fail(std::string msg) { throw RuleError(std::move(msg)); }
 
@@ -534,6 +534,19 @@ RuleBuilder& RuleBuilder::Set(std::string_view key, std::string_view value) {
     RawFlags(static_cast<uint32_t>(ParseNumber(key, value, 0xffffffffu)));
   } else if (key == "rawneg") {
     RawNegate(static_cast<uint32_t>(ParseNumber(key, value, 0xffffffffu)));
+  } else if (key == "wire") {
+    if (value.size() != 2 * FW_RULE_SIZE_V7 && value.size() != 2 * FW_RULE_SIZE_V8) {
+      Fail("wire takes the whole record: " + std::to_string(2 * FW_RULE_SIZE_V7) + " or " +
+           std::to_string(2 * FW_RULE_SIZE_V8) + " hex digits, not " + std::to_string(value.size()));
+    }
+    wire_.assign(value.size() / 2, 0);
+    for (size_t i = 0; i < wire_.size(); i++) {
+      auto [end, ec] = std::from_chars(value.data() + 2 * i, value.data() + 2 * i + 2, wire_[i], 16);
+      if (ec != std::errc() || end != value.data() + 2 * i + 2) {
+        Fail("wire: '" + std::string(value.substr(2 * i, 2)) + "' at digit " + std::to_string(2 * i + 1) +
+             " is not hex");
+      }
+    }
   } else if (key == "exact" || key == "raw") {
     // Markers for the text checks; they change no byte.
   } else {
@@ -556,6 +569,10 @@ FWRule RuleBuilder::Build() const {
   }
   if (rawFlags_) r.ruleFlags = rawFlagsValue_;
   if (rawNeg_) r.negateFlags = rawNegValue_;
+  if (!wire_.empty()) {
+    std::memset(&r, 0, sizeof(r));
+    std::memcpy(&r, wire_.data(), std::min(wire_.size(), sizeof(r)));
+  }
   return r;
 }
 
@@ -720,12 +737,16 @@ std::optional<TextRule> ReadRuleLine(const std::vector<Token>& tokens, uint8_t v
       continue;
     }
     if (key != "ipv4" && key != "ipv6" && key != "exact" && key != "raw" && key != "bidir" &&
-        (!t.hasValue || value.empty())) {
+        (!t.hasValue || value.empty()) && !(raw && key == "pool" && t.hasValue)) {
       rep.At(t, std::string(key) + " needs a value (" + std::string(key) + "=...)");
       continue;
     }
     // Version-7 records have no bytes for these; `raw` leaves the refusal
     // to the builder, which accepts them only when they write zero bytes.
+    if (key == "wire" && !raw) {
+      rep.At(t, "wire= (a whole record in hex) is only read in a raw rule");
+      continue;
+    }
     if (v7 && !raw && (key == "rptag" || key == "dscp" || key == "dot1p")) {
       rep.At(t, std::string(key) + " is a version-8 field; this ruleset is version 7");
       continue;
@@ -1230,7 +1251,7 @@ std::string FormatRuleFields(const FWRule& r, uint8_t version, bool raw) {
   if (ActionUses(a, "gre") || FWNet32(r.greIP) != 0) out += " gre=" + FormatAddr(r.greIP, true);
   if (r.snapLen) out += " snaplen=" + std::to_string(r.snapLen);
   const size_t poolLen = strnlen(r.resourcePool, sizeof(r.resourcePool));
-  if (ActionUses(a, "pool") || poolLen > 0) {
+  if ((ActionUses(a, "pool") || poolLen > 0) && PoolIsText(r)) {
     out += " pool=" + std::string(r.resourcePool, poolLen);
   }
   if (v8) {
@@ -1265,12 +1286,27 @@ std::string FormatRule(const FWRule& rule, uint8_t version) {
   }
   std::string out = FormatRuleFields(rule, version, true);
   std::optional<FWRule> back = ReadBack(out, version);
-  if (!back) return out;  // only a pool name that is not text gets here
   const uint32_t ignore = version < FW_RULESET_VERSION_8 ? FW_WC_RPTAG : 0;
-  if ((back->ruleFlags & ~ignore) != (rule.ruleFlags & ~ignore)) {
+  if (back && (back->ruleFlags & ~ignore) != (rule.ruleFlags & ~ignore)) {
     out += " rawflags=" + Hex(rule.ruleFlags);
   }
-  if (back->negateFlags != rule.negateFlags) out += " rawneg=" + Hex(rule.negateFlags);
+  if (back && back->negateFlags != rule.negateFlags) out += " rawneg=" + Hex(rule.negateFlags);
+  // Bytes no field shows (values under a wildcard, the unused tail of an
+  // IPv4 address, a bound without its range bit) come from senders that
+  // did not start from text; the whole record then follows in hex.
+  back = ReadBack(out, version);
+  if (!back || !SameRecord(*back, rule, version)) {
+    const size_t size = version == FW_RULESET_VERSION_7 ? FW_RULE_SIZE_V7 : FW_RULE_SIZE_V8;
+    FWRule w = rule;
+    if (version == FW_RULESET_VERSION_7) w.ruleFlags &= ~FW_WC_RPTAG;
+    const uint8_t* p = reinterpret_cast<const uint8_t*>(&w);
+    out += " wire=";
+    for (size_t i = 0; i < size; i++) {
+      char buf[3];
+      std::snprintf(buf, sizeof(buf), "%02x", p[i]);
+      out += buf;
+    }
+  }
   return out;
 }
 

@@ -99,6 +99,7 @@ class RuleBuilder {
   bool rawNeg_ = false;
   uint32_t rawFlagsValue_ = 0;
   uint32_t rawNegValue_ = 0;
+  std::vector<uint8_t> wire_;  // a whole record given as wire=HEX
 };
 
 // One error found in a ruleset text. Lines and columns count from 1;
@@ -137,7 +138,7 @@ struct RulesetText {
 // Limits on ruleset texts: longer lines, more rules or more errors end the
 // reading with an error instead of growing without bound.
 inline constexpr size_t kMaxLineLength = 4096;
-inline constexpr size_t kMaxRules = 1u << 20;
+inline constexpr size_t kMaxRules = 1u << 18;
 inline constexpr size_t kMaxDiagnostics = 50;
 
 // Reads a ruleset text: an optional header line
