@@ -276,22 +276,36 @@ std::vector<RuleChange> DiffRules(const RulesetText& a, const RulesetText& b) {
            " frag=" + ActionName(t.fragOverride);
   };
   if (header(a) != header(b)) out.push_back({RuleChange::kChanged, 0, 0, header(a), header(b)});
-  std::map<std::string, std::deque<size_t>> olds;
-  for (size_t i = 0; i < a.rules.size(); i++) olds[MatchKey(a.rules[i].rule, a.version)].push_back(i);
-  std::vector<bool> paired(a.rules.size(), false);
+  // Identical rules pair first, so a rule that only moved is no change;
+  // what is left pairs by what it matches.
+  std::vector<bool> paired(a.rules.size(), false), pairedNew(b.rules.size(), false);
+  std::vector<size_t> partner(b.rules.size(), 0);
+  for (int pass = 0; pass < 2; pass++) {
+    std::map<std::string, std::deque<size_t>> olds;
+    auto key = [&](const FWRule& r, uint8_t v) { return pass == 0 ? Text(r, v) : MatchKey(r, v); };
+    for (size_t i = 0; i < a.rules.size(); i++) {
+      if (!paired[i]) olds[key(a.rules[i].rule, a.version)].push_back(i);
+    }
+    for (size_t n = 0; n < b.rules.size(); n++) {
+      if (pairedNew[n]) continue;
+      auto it = olds.find(key(b.rules[n].rule, b.version));
+      if (it == olds.end() || it->second.empty()) continue;
+      partner[n] = it->second.front();
+      it->second.pop_front();
+      paired[partner[n]] = true;
+      pairedNew[n] = true;
+    }
+  }
   std::vector<RuleChange> news;
-  for (const TextRule& nr : b.rules) {
-    auto it = olds.find(MatchKey(nr.rule, b.version));
+  for (size_t n = 0; n < b.rules.size(); n++) {
+    const TextRule& nr = b.rules[n];
     const std::string nt = Text(nr.rule, b.version);
-    if (it == olds.end() || it->second.empty()) {
+    if (!pairedNew[n]) {
       news.push_back({RuleChange::kAdded, 0, nr.line, "", nt});
       continue;
     }
-    const size_t i = it->second.front();
-    it->second.pop_front();
-    paired[i] = true;
-    const std::string ot = Text(a.rules[i].rule, a.version);
-    if (ot != nt) news.push_back({RuleChange::kChanged, a.rules[i].line, nr.line, ot, nt});
+    const std::string ot = Text(a.rules[partner[n]].rule, a.version);
+    if (ot != nt) news.push_back({RuleChange::kChanged, a.rules[partner[n]].line, nr.line, ot, nt});
   }
   for (size_t i = 0; i < a.rules.size(); i++) {
     if (!paired[i]) out.push_back({RuleChange::kRemoved, a.rules[i].line, 0, Text(a.rules[i].rule, a.version), ""});
