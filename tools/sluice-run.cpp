@@ -31,7 +31,7 @@ constexpr const char kDefaultAgentText[] = "sluice-demo:default-action=ACTION_PU
 // The built-in ruleset: a small web server's policy.
 constexpr const char kDefaultRules[] = R"(ruleset version=8 features=1
 # web traffic to the server is accepted; its replies go out
-action=accept dir=from ipv4 proto=tcp da=10.0.0.10 dport=80 sa=10.0.0.1 sport=40000 bidir
+action=accept dir=from exact dmac=02:00:00:00:00:10 smac=02:00:00:00:00:01 vlan=none ipv4 sa=10.0.0.1 da=10.0.0.10 proto=tcp sport=40000 dport=80 bidir
 # ssh from the management range, counted in the ordered list
 action=accept dir=from ipv4 proto=tcp sa=192.168.1.0-192.168.1.255 da=10.0.0.10 dport=22
 # anything else for port 22 is dropped
