@@ -181,6 +181,14 @@ TEST(Diff, CaptureVerdictsComeFromTheModule) {
   EXPECT_EQ(got[2].packet, 5u);
   EXPECT_EQ(got[2].after.line, 4u);
 
+  // Same action, another GRE destination: the copies go elsewhere.
+  const rules::RulesetText g1 = Read("action=gre gre=192.0.2.1 proto=tcp\n");
+  const rules::RulesetText g2 = Read("action=gre gre=192.0.2.2 proto=tcp\n");
+  ASSERT_TRUE(rules::DiffVerdicts(g1, g2, capture, &got, &error)) << error;
+  ASSERT_EQ(got.size(), 4u);  // every TCP packet, not the ARP frame
+  EXPECT_EQ(got[0].before.Describe(), "gre gre=192.0.2.1 (general rule, line 1)");
+  EXPECT_EQ(got[0].after.Describe(), "gre gre=192.0.2.2 (general rule, line 1)");
+
   // A ruleset the module refuses is reported, not traced.
   rules::RulesetText bad = a;
   bad.version = 9;

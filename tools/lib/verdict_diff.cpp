@@ -2,6 +2,8 @@
 
 #include "tools/lib/verdict_diff.h"
 
+#include <cstring>
+
 #include "firewall/fw_trace.h"
 #include "host/core/host_core.h"
 #include "host/net/packets.h"
@@ -38,10 +40,29 @@ size_t LineOf(const RulesetText& text, const FWTrace& t) {
   return 0;
 }
 
+// The action parameters of a deciding rule, as the rule text writes them.
+std::string ParamsOf(const FWTrace& t) {
+  if (t.decision != FWTraceExactRule && t.decision != FWTraceGeneralRule) return {};
+  FWRule only;
+  std::memset(&only, 0, sizeof(only));
+  only.action = t.rule.action;
+  only.direction = SLCGenericDirectionBidirectional;
+  only.ruleFlags = FW_WC_ALL | FW_FLAG_IPV4;
+  std::memcpy(only.rewriteMac, t.rule.rewriteMac, sizeof(only.rewriteMac));
+  std::memcpy(only.greIP, t.rule.greIP, sizeof(only.greIP));
+  only.snapLen = t.rule.snapLen;
+  std::memcpy(only.resourcePool, t.rule.resourcePool, sizeof(only.resourcePool));
+  only.dscpTag = t.rule.dscpTag;
+  only.ethDot1PTag = t.rule.ethDot1PTag;
+  std::string text = FormatRule(only);
+  const size_t space = text.find(' ', text.find("action="));
+  return space == std::string::npos ? std::string() : text.substr(space + 1);
+}
+
 }  // namespace
 
 std::string PacketVerdict::Describe() const {
-  std::string what = ActionName(action);
+  std::string what = ActionName(action) + (params.empty() ? "" : " " + params);
   switch (decision) {
     case FWTraceExactRule:
       return what + " (exact rule, line " + std::to_string(line) + ")";
@@ -111,8 +132,11 @@ bool DiffVerdicts(const RulesetText& oldText, const RulesetText& newText,
       v[i].decision = t.decision;
       v[i].action = t.action;
       v[i].line = LineOf(i == 0 ? oldText : newText, t);
+      v[i].params = ParamsOf(t);
     }
-    if (ok && v[0].action != v[1].action) changes->push_back({n + 1, dir, v[0], v[1]});
+    if (ok && (v[0].action != v[1].action || v[0].params != v[1].params)) {
+      changes->push_back({n + 1, dir, v[0], v[1]});
+    }
   }
   for (host::FilterId f : filters) {
     if (f != 0) (void)host::Sluice::DestroyFilter(f);

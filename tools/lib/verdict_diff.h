@@ -21,6 +21,7 @@ struct PacketVerdict {
   uint32_t decision = 0;  // FWTraceDecision
   uint32_t action = 0;    // the action carried out
   size_t line = 0;        // the deciding rule's line in the text, 0 if none
+  std::string params;     // the deciding rule's action parameters ("gre=..."), if any
   std::string Describe() const;
 };
 
@@ -31,7 +32,8 @@ struct VerdictChange {
 };
 
 // Traces every record through a filter holding `oldText` and one holding
-// `newText`; lists the packets whose action differs. Records without a
+// `newText`; lists the packets whose action, or the parameters of the
+// action (GRE destination, rewrite address, pool, marks), differ. Records without a
 // direction count as coming from the switch. False with a reason when the
 // module refuses to start or a ruleset is refused.
 bool DiffVerdicts(const RulesetText& oldText, const RulesetText& newText,
