@@ -57,6 +57,8 @@ TEST(RuleText, EachBadFieldIsReportedWhereItIs) {
        "dscp is a version-8 field; this ruleset is version 7"},
       {"ruleset version=7\nsport=!80", 2, 7,
        "negation ('!') needs a version-8 ruleset; this one is version 7"},
+      {"ruleset version=7\nraw action=dscp dscp=3", 2, 1,
+       "the rule sets version-8 bytes (rptag, marks, masks or negation) in a version-7 ruleset"},
       {"ruleset version=9", 1, 17, "version '9' is not 7 or 8"},
       {"ruleset features=drop-bdpu", 1, 18, "unknown feature 'drop-bdpu'; did you mean 'drop-bpdu'?"},
       {"ruleset frag=dorp", 1, 14, "unknown fragment action 'dorp'; did you mean 'drop'?"},

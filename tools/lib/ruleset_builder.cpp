@@ -1088,6 +1088,18 @@ RulesetText ReadRulesetText(std::string_view text) {
       break;
     }
     std::optional<TextRule> tr = ReadRuleLine(tokens, out.version, rep);
+    if (tr && out.version == FW_RULESET_VERSION_7) {
+      // Reached only by raw rules: the checked ones refuse these fields.
+      const uint8_t* bytes = reinterpret_cast<const uint8_t*>(&tr->rule);
+      for (uint32_t b = FW_RULE_SIZE_V7; b < FW_RULE_SIZE_V8; b++) {
+        if (bytes[b] != 0) {
+          rep.At(tokens[0], "the rule sets version-8 bytes (rptag, marks, masks or negation) in a "
+                            "version-7 ruleset");
+          tr.reset();
+          break;
+        }
+      }
+    }
     if (tr) {
       tr->line = lineNo;
       out.rules.push_back(*tr);
