@@ -178,7 +178,7 @@ TEST(RuleText, FieldsMeanWhatAReaderExpects) {
   EXPECT_EQ(d.fwFeatures, 3u);
   EXPECT_EQ(d.fragOverride, uint32_t{SLCGenericActionPunt});
   ASSERT_EQ(d.rules.size(), 2u);
-  EXPECT_EQ(d.rules[1].action, uint32_t{SLCGenericActionDrop});
+  EXPECT_EQ(uint32_t{d.rules[1].action}, uint32_t{SLCGenericActionDrop});
   EXPECT_EQ(d.rules[1].ruleFlags & FW_WC_ALL, FW_WC_ALL);
   EXPECT_EQ(d.rules[1].direction, SLCGenericDirectionBidirectional);
   EXPECT_EQ(rules::FormatRuleset(Bytes("default=punt\n")), "ruleset version=8\ndefault=punt\n");
