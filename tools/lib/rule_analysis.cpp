@@ -179,8 +179,13 @@ std::vector<Finding> Lint(const RulesetText& text) {
   const std::vector<TextRule>& rs = text.rules;
   // Pairwise checks are quadratic; past this many rules only the per-rule
   // checks run.
-  constexpr size_t kPairLimit = 20000;
+  constexpr size_t kPairLimit = 5000;
   const bool pairs = rs.size() <= kPairLimit;
+  if (!pairs) {
+    out.push_back({0, 0,
+                   "more than " + std::to_string(kPairLimit) +
+                       " rules: rules hidden by other rules are not looked for"});
+  }
   auto name = [](const TextRule& t) { return "line " + std::to_string(t.line); };
   for (size_t i = 0; i < rs.size(); i++) {
     const FWRule& r = rs[i].rule;
