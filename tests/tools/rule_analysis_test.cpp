@@ -86,7 +86,10 @@ TEST(Lint, NamesBothRulesOfEachFinding) {
       "action=log " + t + " sport=1000-1000 dport=22\n"                            // 10 under exact 7
       "action=log dir=invalid proto=udp\n"                                         // 11
       "action=accept proto=udp dport=53 bidir\n"                                   // 12 bidir, no effect
-      "default=drop\n";                                                            // 13
+      "action=drop dmac=02:00:00:00:00:02 smac=02:00:00:00:00:01 vlan=none ipv4 sa=10.0.0.2 "
+      "da=10.0.0.1 proto=tcp sport=22 dport=1001\n"                                // 13
+      "action=accept " + t + " sport=1001 dport=22 bidir\n"                       // 14 mirror is 13
+      "default=drop\n";                                                            // 15
   const std::vector<rules::Finding> got = rules::Lint(Read(text));
   const struct {
     size_t line, other;
@@ -103,6 +106,8 @@ TEST(Lint, NamesBothRulesOfEachFinding) {
               "is probed before any general rule"},
       {11, 0, "dir=invalid: the rule never matches"},
       {12, 0, "bidir has no effect on a general rule: only exact rules get a mirrored half"},
+      {14, 13, "its mirrored half has the same tuple as line 13 and merges into it: the replies "
+               "get line 13's action (drop), not accept"},
   };
   ASSERT_EQ(got.size(), std::size(want));
   for (size_t i = 0; i < got.size(); i++) {

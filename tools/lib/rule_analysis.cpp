@@ -221,6 +221,12 @@ std::vector<Finding> Lint(const RulesetText& text) {
           if (o.action != r.action) msg += "; this rule's action " + ActionName(r.action) + " is never used";
           out.push_back({rs[i].line, rs[j].line, msg});
           reported = true;
+        } else if (r.bidirectional == 1 && SameTuple(MirrorOf(r), o) && o.action != r.action) {
+          out.push_back({rs[i].line, rs[j].line,
+                         "its mirrored half has the same tuple as " + name(rs[j]) +
+                             " and merges into it: the replies get " + name(rs[j]) + "'s action (" +
+                             ActionName(o.action) + "), not " + ActionName(r.action)});
+          reported = true;
         }
       } else if (!exact && oExact) {
         const bool mirrored = o.bidirectional == 1 && Covers(MirrorOf(o), r);
