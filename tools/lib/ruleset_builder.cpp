@@ -631,7 +631,7 @@ class Reporter {
     d.message = std::move(message);
     d.note = std::move(note);
     constexpr size_t kWindow = 160;
-    d.sourceColumn = col > kWindow / 2 ? col - kWindow / 2 : 1;
+    d.sourceColumn = std::min(col > kWindow / 2 ? col - kWindow / 2 : 1, line_.size() + 1);
     for (char c : line_.substr(d.sourceColumn - 1, kWindow)) {
       d.source += (std::isprint(static_cast<unsigned char>(c)) || c == '\t') ? c : '?';
     }
