@@ -16,6 +16,9 @@
 //    exact or general) and reports every error with line and column.
 //    ParseRuleset, TryParseRuleset, ParseRule and TryParseRule go through it.
 //
+// rule_text.cpp reads texts, ruleset_builder.cpp builds, formats and
+// decodes, rule_syntax.{h,cpp} holds what both share.
+//
 // FormatRule/FormatRuleset print the checked language whenever the record
 // can be said in it, and otherwise the rule marked `raw`, where the value
 // checks are off; either way the text compiles back to the same bytes.
