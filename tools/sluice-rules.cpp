@@ -124,7 +124,10 @@ int Check(const std::string& in, bool quiet) {
       if (r.rule.bidirectional == 1) kind += " + mirrored half";
     } else {
       std::string list;
-      for (const std::string& w : why) list += (list.empty() ? "" : ", ") + w;
+      for (const std::string& w : why) {
+        if (!list.empty()) list += ", ";
+        list += w;
+      }
       kind = "general (ordered list: " + list + ")";
     }
     std::printf("%s:%zu: %s\n", in.c_str(), r.line, kind.c_str());

@@ -216,10 +216,16 @@ std::string DirectionName(uint8_t direction) {
 std::string FeatureNames(uint32_t features) {
   std::string out;
   for (const FeatureName& f : kFeatureNames) {
-    if (features & f.bit) out += (out.empty() ? "" : ",") + std::string(f.name);
+    if (features & f.bit) {
+      if (!out.empty()) out += ',';
+      out += f.name;
+    }
     features &= ~f.bit;
   }
-  if (features) out += (out.empty() ? "" : ",") + Hex(features);
+  if (features) {
+    if (!out.empty()) out += ',';
+    out += Hex(features);
+  }
   return out.empty() ? "none" : out;
 }
 

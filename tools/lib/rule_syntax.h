@@ -89,7 +89,10 @@ std::string DidYouMean(std::string_view word, const Names& names) {
 template <typename Names>
 std::string NameList(const Names& names) {
   std::string out;
-  for (const auto& n : names) out += (out.empty() ? "" : " ") + std::string(n);
+  for (const auto& n : names) {
+    if (!out.empty()) out += ' ';
+    out += n;
+  }
   return out;
 }
 

@@ -283,7 +283,10 @@ std::optional<TextRule> ReadRuleLine(const std::vector<Token>& tokens, uint8_t v
     const std::vector<std::string> why = GeneralReasons(r);
     if (!why.empty()) {
       std::string list;
-      for (const std::string& w : why) list += (list.empty() ? "" : ", ") + w;
+      for (const std::string& w : why) {
+        if (!list.empty()) list += ", ";
+        list += w;
+      }
       rep.At(*ex, "the rule cannot be exact: " + list,
              "an exact rule gives dmac smac ethtype vlan sa da proto sport dport, without ranges or masks");
     } else if (r.ipProto != 6 && r.ipProto != 17) {
