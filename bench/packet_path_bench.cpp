@@ -198,12 +198,13 @@ class Scenario {
   }
 
   void BuildGeneral() {
-    // size_ - 1 rules that fail on the destination port, the last one matches.
+    // size_ - 1 rules that fail on the destination port, the last one matches
+    // (ethtype=any: the port is the only field compared after the protocol).
     std::string text;
     for (uint32_t j = 0; j + 1 < size_; j++) {
-      text += "action=drop ipv4 proto=tcp dport=" + std::to_string(1000 + j % 60000) + "\n";
+      text += "action=drop ipv4 ethtype=any proto=tcp dport=" + std::to_string(1000 + j % 60000) + "\n";
     }
-    text += "action=accept ipv4 proto=tcp dport=80\n";
+    text += "action=accept ipv4 ethtype=any proto=tcp dport=80\n";
     Apply(rules::ParseRuleset(text));
     std::vector<uint32_t> flows;
     for (uint32_t i = 0; i < kListLen; i++) flows.push_back(i);

@@ -1,79 +1,257 @@
-// sluice-rules: compiles rulesets between the rule text syntax and the wire
-// format that the ruleset property, the filter ioctl and the character
-// device carry.
+// sluice-rules: the rule text language's compiler and its checks.
 //
-//   sluice-rules compile web.rules web.bin     text -> wire (version from the
-//                                              header line, default 8)
+//   sluice-rules compile web.rules web.bin     text -> wire
 //   sluice-rules decode web.bin                wire -> text on stdout
-//   sluice-rules check web.rules               parse only; prints rule kinds
+//   sluice-rules check web.rules               errors, and each rule's kind
+//   sluice-rules lint web.rules                rules that never match and
+//                                              flags without effect
+//   sluice-rules diff old.rules new.rules [--capture c.pcap]
+//
+// Every command reads the same language through ReadRulesetText, so check
+// and compile accept exactly the same texts.
+
+#include <CLI/CLI.hpp>
 
 #include <cstdio>
 #include <fstream>
-#include <sstream>
 #include <string>
 #include <vector>
 
+#include "firewall/fw_trace.h"
+#include "tools/lib/capture.h"
+#include "tools/lib/frames.h"
+#include "tools/lib/rule_analysis.h"
 #include "tools/lib/ruleset_builder.h"
+#include "tools/lib/verdict_diff.h"
 
 namespace {
 
-bool ReadFile(const std::string& path, std::string* out) {
-  std::ifstream in(path, std::ios::binary);
-  if (!in) return false;
-  std::stringstream ss;
-  ss << in.rdbuf();
-  *out = ss.str();
+// Rule texts and wire rulesets larger than this are refused before they are
+// read, so a hostile file cannot make the tool allocate without bound.
+constexpr uint64_t kMaxFileBytes = 256ull << 20;
+
+bool ReadBounded(const std::string& path, std::string* out) {
+  std::ifstream in(path, std::ios::binary | std::ios::ate);
+  if (!in) {
+    std::fprintf(stderr, "sluice-rules: cannot read %s\n", path.c_str());
+    return false;
+  }
+  const std::streamoff size = in.tellg();
+  if (size < 0 || static_cast<uint64_t>(size) > kMaxFileBytes) {
+    std::fprintf(stderr, "sluice-rules: %s: larger than %llu MiB\n", path.c_str(),
+                 static_cast<unsigned long long>(kMaxFileBytes >> 20));
+    return false;
+  }
+  out->resize(static_cast<size_t>(size));
+  in.seekg(0);
+  in.read(out->data(), size);
+  if (!in) {
+    std::fprintf(stderr, "sluice-rules: cannot read %s\n", path.c_str());
+    return false;
+  }
   return true;
 }
 
-int Usage() {
-  std::fprintf(stderr,
-               "usage: sluice-rules compile TEXT_FILE WIRE_FILE\n"
-               "       sluice-rules decode WIRE_FILE\n"
-               "       sluice-rules check TEXT_FILE\n");
-  return 2;
+// A rules file: text, or a wire ruleset (first byte 7 or 8) read as the
+// text decode prints. Prints the errors and returns false when it has any.
+bool Load(const std::string& path, rules::RulesetText* out) {
+  std::string data;
+  if (!ReadBounded(path, &data)) return false;
+  if (!data.empty() && (data[0] == 7 || data[0] == 8)) {
+    try {
+      data = rules::FormatRuleset(std::span(reinterpret_cast<const uint8_t*>(data.data()), data.size()));
+    } catch (const rules::RuleError& e) {
+      std::fprintf(stderr, "sluice-rules: %s: %s\n", path.c_str(), e.what());
+      return false;
+    }
+  }
+  *out = rules::ReadRulesetText(data);
+  if (!out->Ok()) {
+    std::fputs(rules::RenderDiagnostics(path, out->diagnostics).c_str(), stderr);
+    return false;
+  }
+  return true;
+}
+
+int Compile(const std::string& in, const std::string& outPath) {
+  rules::RulesetText text;
+  if (!Load(in, &text)) return 1;
+  std::vector<uint8_t> bytes;
+  try {
+    bytes = rules::RulesetBytes(text);
+  } catch (const rules::RuleError& e) {
+    std::fprintf(stderr, "sluice-rules: %s: %s\n", in.c_str(), e.what());
+    return 1;
+  }
+  std::ofstream out(outPath, std::ios::binary);
+  out.write(reinterpret_cast<const char*>(bytes.data()), static_cast<std::streamsize>(bytes.size()));
+  if (!out) {
+    std::fprintf(stderr, "sluice-rules: cannot write %s\n", outPath.c_str());
+    return 1;
+  }
+  std::printf("%zu rules, %zu bytes\n", text.rules.size(), bytes.size());
+  return 0;
+}
+
+int Decode(const std::string& in) {
+  std::string data;
+  if (!ReadBounded(in, &data)) return 1;
+  try {
+    std::fputs(rules::FormatRuleset(std::span(reinterpret_cast<const uint8_t*>(data.data()), data.size())).c_str(),
+               stdout);
+  } catch (const rules::RuleError& e) {
+    std::fprintf(stderr, "sluice-rules: %s: %s\n", in.c_str(), e.what());
+    return 1;
+  }
+  return 0;
+}
+
+int Check(const std::string& in, bool quiet) {
+  rules::RulesetText text;
+  if (!Load(in, &text)) return 1;
+  size_t exact = 0, mirrors = 0;
+  for (const rules::TextRule& r : text.rules) {
+    const std::vector<std::string> why = rules::GeneralReasons(r.rule);
+    if (why.empty()) {
+      exact++;
+      if (r.rule.bidirectional == 1) mirrors++;
+    }
+    if (quiet) continue;
+    std::string kind;
+    if (r.isDefault) {
+      kind = "general (default: catches every packet no other rule took)";
+    } else if (why.empty()) {
+      kind = "exact   (hash table, probed before every general rule)";
+      if (r.rule.bidirectional == 1) kind += " + mirrored half";
+    } else {
+      std::string list;
+      for (const std::string& w : why) {
+        if (!list.empty()) list += ", ";
+        list += w;
+      }
+      kind = "general (ordered list: " + list + ")";
+    }
+    std::printf("%s:%zu: %s\n", in.c_str(), r.line, kind.c_str());
+  }
+  std::printf("%s: version %u, %zu rules: %zu exact (%zu mirrored), %zu general\n", in.c_str(),
+              text.version, text.rules.size(), exact, mirrors, text.rules.size() - exact);
+  return 0;
+}
+
+int Lint(const std::string& in) {
+  rules::RulesetText text;
+  if (!Load(in, &text)) return 1;
+  const std::vector<rules::Finding> findings = rules::Lint(text);
+  for (const rules::Finding& f : findings) {
+    std::printf("%s:%zu: %s\n", in.c_str(), f.line, f.message.c_str());
+  }
+  if (findings.empty()) std::printf("%s: no findings\n", in.c_str());
+  return findings.empty() ? 0 : 1;
+}
+
+int Diff(const std::string& a, const std::string& b, const std::string& capture,
+         const frames::DirectionRule& directionRule) {
+  rules::RulesetText oldText, newText;
+  if (!Load(a, &oldText) || !Load(b, &newText)) return 2;
+  const std::vector<rules::RuleChange> changes = rules::DiffRules(oldText, newText);
+  for (const rules::RuleChange& c : changes) {
+    switch (c.kind) {
+      case rules::RuleChange::kRemoved:
+        std::printf("- %s:%zu: %s\n", a.c_str(), c.oldLine, c.oldText.c_str());
+        break;
+      case rules::RuleChange::kAdded:
+        std::printf("+ %s:%zu: %s\n", b.c_str(), c.newLine, c.newText.c_str());
+        break;
+      case rules::RuleChange::kChanged:
+        if (c.oldLine == 0) {
+          std::printf("~ header: %s\n       -> %s\n", c.oldText.c_str(), c.newText.c_str());
+        } else {
+          std::printf("~ %s:%zu -> %s:%zu: %s\n       -> %s\n", a.c_str(), c.oldLine, b.c_str(),
+                      c.newLine, c.oldText.c_str(), c.newText.c_str());
+        }
+        break;
+    }
+  }
+  size_t verdicts = 0;
+  if (!capture.empty()) {
+    frames::CaptureRead read = frames::ReadCapture(capture);
+    if (!read.ok()) {
+      std::fprintf(stderr, "sluice-rules: %s: %s\n", capture.c_str(), read.error.c_str());
+      return 2;
+    }
+    std::vector<frames::CaptureRecord> records = std::move(read.records);
+    if (std::optional<size_t> bad = frames::ResolveDirections(&records, directionRule)) {
+      std::fprintf(stderr,
+                   "sluice-rules: %s: record %zu has no direction (the capture records none; "
+                   "give --direction, --vm-mac or --vm-ip)\n",
+                   capture.c_str(), *bad + 1);
+      return 2;
+    }
+    std::string error;
+    std::vector<rules::VerdictChange> vc;
+    if (!rules::DiffVerdicts(oldText, newText, records, &vc, &error)) {
+      std::fprintf(stderr, "sluice-rules: %s\n", error.c_str());
+      return 2;
+    }
+    for (const rules::VerdictChange& v : vc) {
+      std::printf("packet %zu (%s): %s -> %s\n", v.packet, v.direction == 2 ? "to switch" : "from switch",
+                  v.before.Describe().c_str(), v.after.Describe().c_str());
+    }
+    std::printf("%zu of %zu packets change verdict\n", vc.size(), records.size());
+    verdicts = vc.size();
+  }
+  if (changes.empty() && verdicts == 0) std::printf("no differences\n");
+  return changes.empty() && verdicts == 0 ? 0 : 1;
 }
 
 }  // namespace
 
 int main(int argc, char** argv) {
-  if (argc < 3) return Usage();
-  const std::string cmd = argv[1];
-  std::string input;
-  if (!ReadFile(argv[2], &input)) {
-    std::fprintf(stderr, "sluice-rules: cannot read %s\n", argv[2]);
-    return 1;
+  CLI::App app{"Compiles, checks, lints and compares firewall rulesets.", "sluice-rules"};
+  app.require_subcommand(1);
+  app.footer(std::string("\n") + rules::kRuleSyntaxHelp);
+  std::string in, out, other, capture;
+  bool quiet = false;
+
+  CLI::App* compile = app.add_subcommand("compile", "rule text -> wire ruleset");
+  compile->add_option("TEXT", in, "rule text file")->required();
+  compile->add_option("WIRE", out, "wire ruleset to write")->required();
+  CLI::App* decode = app.add_subcommand("decode", "wire ruleset -> rule text on stdout");
+  decode->add_option("WIRE", in, "wire ruleset")->required();
+  CLI::App* check = app.add_subcommand(
+      "check", "report every error; say for each rule whether it is exact or general and why");
+  check->add_option("TEXT", in, "rule text file")->required();
+  check->add_flag("-q,--quiet", quiet, "only the summary line");
+  CLI::App* lint = app.add_subcommand(
+      "lint", "rules that never match, merge into another or carry flags without effect "
+              "(exit 1 when there are findings)");
+  lint->add_option("TEXT", in, "rule text file")->required();
+  CLI::App* diff = app.add_subcommand(
+      "diff", "rules added, removed and changed; with --capture, the packets whose verdict "
+              "changes (exit 1 when anything differs)");
+  diff->add_option("OLD", in, "old ruleset (text or wire)")->required();
+  diff->add_option("NEW", other, "new ruleset (text or wire)")->required();
+  diff->add_option("--capture", capture,
+                   "pcap or pcapng capture whose packets are traced through both");
+  std::string direction = "auto", vmMac, vmIp;
+  diff->add_option("--direction", direction,
+                   "direction of records whose capture does not give one: from (the switch), "
+                   "to (the switch) or auto (by --vm-mac/--vm-ip)")
+      ->check(CLI::IsMember({"from", "to", "auto"}))
+      ->capture_default_str();
+  diff->add_option("--vm-mac", vmMac, "MAC address of the VM side, for --direction auto");
+  diff->add_option("--vm-ip", vmIp, "IPv4 or IPv6 address of the VM side, for --direction auto");
+
+  CLI11_PARSE(app, argc, argv);
+  if (*compile) return Compile(in, out);
+  if (*decode) return Decode(in);
+  if (*check) return Check(in, quiet);
+  if (*lint) return Lint(in);
+  frames::DirectionRule directionRule;
+  std::string error;
+  if (!frames::MakeDirectionRule(direction, vmMac, vmIp, &directionRule, &error)) {
+    std::fprintf(stderr, "sluice-rules: %s\n", error.c_str());
+    return 2;
   }
-  try {
-    if (cmd == "compile" && argc == 4) {
-      std::vector<uint8_t> bytes = rules::RulesetBuilder().AddText(input).Bytes();
-      std::ofstream out(argv[3], std::ios::binary);
-      out.write(reinterpret_cast<const char*>(bytes.data()),
-                static_cast<std::streamsize>(bytes.size()));
-      if (!out) {
-        std::fprintf(stderr, "sluice-rules: cannot write %s\n", argv[3]);
-        return 1;
-      }
-      std::printf("%zu bytes\n", bytes.size());
-      return 0;
-    }
-    if (cmd == "decode" && argc == 3) {
-      std::vector<uint8_t> bytes(input.begin(), input.end());
-      std::fputs(rules::FormatRuleset(bytes).c_str(), stdout);
-      return 0;
-    }
-    if (cmd == "check" && argc == 3) {
-      rules::RulesetBuilder builder;
-      builder.AddText(input);
-      size_t exact = 0;
-      for (const FWRule& r : builder.Rules()) exact += rules::IsExactRule(r) ? 1 : 0;
-      std::printf("%zu rules: %zu exact, %zu general\n", builder.Rules().size(), exact,
-                  builder.Rules().size() - exact);
-      return 0;
-    }
-  } catch (const rules::RuleError& e) {
-    std::fprintf(stderr, "sluice-rules: %s: %s\n", argv[2], e.what());
-    return 1;
-  }
-  return Usage();
+  return Diff(in, other, capture, directionRule);
 }

@@ -44,7 +44,7 @@ constexpr size_t kMaxRulesText = 64u << 20;
 // The built-in ruleset: a small web server's policy.
 constexpr const char kDefaultRules[] = R"(ruleset version=8 features=1
 # web traffic to the server is accepted; its replies go out
-action=accept dir=from ipv4 proto=tcp da=10.0.0.10 dport=80 sa=10.0.0.1 sport=40000 bidir
+action=accept dir=from exact dmac=02:00:00:00:00:10 smac=02:00:00:00:00:01 vlan=none ipv4 sa=10.0.0.1 da=10.0.0.10 proto=tcp sport=40000 dport=80 bidir
 # ssh from the management range, counted in the ordered list
 action=accept dir=from ipv4 proto=tcp sa=192.168.1.0-192.168.1.255 da=10.0.0.10 dport=22
 # anything else for port 22 is dropped
@@ -143,43 +143,6 @@ std::optional<std::string> ReadText(const std::string& path, std::string* error)
   return ss.str();
 }
 
-bool ParseMac(const std::string& text, frames::MacAddr* mac) {
-  unsigned b[6];
-  char tail;
-  if (std::sscanf(text.c_str(), "%x:%x:%x:%x:%x:%x%c", &b[0], &b[1], &b[2], &b[3], &b[4], &b[5],
-                  &tail) != 6) {
-    return false;
-  }
-  for (int i = 0; i < 6; i++) {
-    if (b[i] > 0xff) return false;
-    (*mac)[i] = static_cast<uint8_t>(b[i]);
-  }
-  return true;
-}
-
-bool ParseIp4(const std::string& text, frames::Ip4Addr* ip) {
-  unsigned b[4];
-  char tail;
-  if (std::sscanf(text.c_str(), "%u.%u.%u.%u%c", &b[0], &b[1], &b[2], &b[3], &tail) != 4) {
-    return false;
-  }
-  for (int i = 0; i < 4; i++) {
-    if (b[i] > 0xff) return false;
-    (*ip)[i] = static_cast<uint8_t>(b[i]);
-  }
-  return true;
-}
-
-// An IPv6 literal through the rule syntax's own parser, so both accept the
-// same text.
-bool ParseIp6(const std::string& text, frames::Ip6Addr* ip) {
-  FWRule rule;
-  std::string error;
-  if (!rules::TryParseRule("ipv6 sa=" + text, &rule, &error)) return false;
-  std::copy(rule.ipSa, rule.ipSa + 16, ip->begin());
-  return true;
-}
-
 struct Output {
   const std::string* path;
   const std::vector<frames::CaptureRecord>* records;
@@ -247,22 +210,10 @@ int main(int argc, char** argv) {
   if (toStdout > 1) return Fail("only one output can go to standard output", kExitUsage);
 
   frames::DirectionRule directionRule;
-  if (o.direction == "from") directionRule.fixed = frames::kDirectionFromSwitch;
-  if (o.direction == "to") directionRule.fixed = frames::kDirectionToSwitch;
-  if (!o.vmMac.empty()) {
-    frames::MacAddr mac;
-    if (!ParseMac(o.vmMac, &mac)) return Fail("--vm-mac: not a MAC address: " + o.vmMac, kExitUsage);
-    directionRule.vmMac = mac;
-  }
-  if (!o.vmIp.empty()) {
-    frames::Ip4Addr ip4;
-    frames::Ip6Addr ip6;
-    if (ParseIp4(o.vmIp, &ip4)) {
-      directionRule.vmIp4 = ip4;
-    } else if (o.vmIp.find(':') != std::string::npos && ParseIp6(o.vmIp, &ip6)) {
-      directionRule.vmIp6 = ip6;
-    } else {
-      return Fail("--vm-ip: not an IPv4 or IPv6 address: " + o.vmIp, kExitUsage);
+  {
+    std::string error;
+    if (!frames::MakeDirectionRule(o.direction, o.vmMac, o.vmIp, &directionRule, &error)) {
+      return Fail(error, kExitUsage);
     }
   }
 
@@ -270,7 +221,7 @@ int main(int argc, char** argv) {
   config.agentText = o.agentText;
   config.slowPath = o.slowPath;
   config.failurePolicy = o.failurePolicy;
-  if (!ParseIp4(o.greSource, &config.greSource)) {
+  if (!frames::TryParseIp4(o.greSource, &config.greSource)) {
     return Fail("--gre-source: not an IPv4 address: " + o.greSource, kExitUsage);
   }
   if (!o.noRules) {
@@ -281,11 +232,16 @@ int main(int argc, char** argv) {
       if (!read) return Fail(error);
       text = std::move(*read);
     }
-    std::string error;
-    if (!rules::TryParseRuleset(text, &config.ruleset, &error)) {
-      return Fail((o.rulesPath.empty() ? std::string("built-in rules") : o.rulesPath) + ": " +
-                  error);
+    // Rule text errors come located, as sluice-rules reports them.
+    const rules::RulesetText read = rules::ReadRulesetText(text);
+    if (!read.Ok()) {
+      const std::string file = o.rulesPath.empty() ? "built-in rules"
+                               : o.rulesPath == "-" ? "<stdin>"
+                                                    : o.rulesPath;
+      std::fputs(rules::RenderDiagnostics(file, read.diagnostics).c_str(), stderr);
+      return kExitError;
     }
+    config.ruleset = rules::RulesetBytes(read);
   }
 
   int exitStatus = 0;

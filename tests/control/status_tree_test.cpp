@@ -119,7 +119,7 @@ const std::string kExact443 = "action=accept dir=to" + kFlowF + " dport=443";
 // shown (exact rules first, then the general rules in ruleset order), and
 // the fields to check.
 TEST_F(StatusTreeTest, RuleSummaryRendersEveryField) {
-  FWRule pool = rules::ParseRule("action=pooltag proto=udp");
+  FWRule pool = rules::ParseRule("raw action=pooltag proto=udp");
   std::memset(pool.resourcePool, 'p', sizeof(pool.resourcePool));  // no NUL: cut, not overread
   auto rule = [](const std::string& text) { return rules::ParseRule(text); };
   const struct { std::vector<FWRule> rules; uint8_t version; int64_t at; Fields want; } rows[] = {
@@ -134,7 +134,7 @@ TEST_F(StatusTreeTest, RuleSummaryRendersEveryField) {
         {"action", "SLCGenericActionAccept (accept packets)"}, {"greIP", "~"}, {"rewriteMac", "~"},
         {"resourcePool", "~"}, {"rpTag", "*"}, {"ethDot1PTag", "~"}, {"dscpTag", "~"},
         {"pktCount", "0"}, {"byteCount", "0"}}},
-      {{rule("action=drop dir=both bidir ipv4 dmac=00:11:22:33:44:55/ff:ff:ff:00:00:00 "
+      {{rule("action=drop dir=both bidir dmac=00:11:22:33:44:55/ff:ff:ff:00:00:00 "
              "smac=!00:11:22:33:44:55/00:11:22:33:44:55 ethtype=!0x0800 vlan=!raw:8100000a "
              "sa=10.0.0.1-10.0.0.9 da=!10.0.0.3-10.0.0.7 proto=!17 sport=80 dport=!1000-2000 "
              "pkts=18446744073709551615 bytes=1234567890123")}, 8, 0,
@@ -146,7 +146,7 @@ TEST_F(StatusTreeTest, RuleSummaryRendersEveryField) {
         {"direction", "SLCGenericDirectionBidirectional (bidirectional)"},
         {"rangesEnabled", "ipSa,ipDa,dPort,ethDA,ethSA"},
         {"pktCount", "18446744073709551615"}, {"byteCount", "1234567890123"}}},
-      {{rule("action=drop ipv6 sa=2001:db8::1-2001:db8::9 da=!fe80::aa:1")}, 8, 0,
+      {{rule("action=drop ipv6 ethtype=any sa=2001:db8::1-<2001:db8::9 da=!fe80::aa:1")}, 8, 0,
        {{"ipSa", "(IPv6): (2001:db8:0:0:0:0:0:1 - 2001:db8:0:0:0:0:0:9)"},
         {"ipDa", "(IPv6): !(fe80:0:0:0:0:0:aa:1)"}, {"rangesEnabled", "ipSa"},
         {"wildcardsEnabled", "dMac,sMac,ethType,vlan.1Q,ipProto,sPort,dPort,rptag"}}},
@@ -163,7 +163,7 @@ TEST_F(StatusTreeTest, RuleSummaryRendersEveryField) {
       // Version 7: shown as the version-8 rule the filter holds for it (the
       // pool tag never compared, nothing negated, zero masks and tags).
       {{rule("proto=tcp dport=21"), rule("proto=tcp dport=22"),
-        rule("action=dscp+dot1p ipv4 dmac=00:11:22:33:44:55 proto=tcp dport=23")}, 7, 2,
+        rule("raw action=dscp+dot1p ipv4 ethtype=any dmac=00:11:22:33:44:55 proto=tcp dport=23")}, 7, 2,
        {{"dPort", "(23)"}, {"wildcardsEnabled", "sMac,ethType,vlan.1Q,ipSa,ipDa,sPort,rptag"},
         {"rpTag", "*"}, {"dMac", " (00:11:22:33:44:55/00:00:00:00:00:00)"}, {"ipProto", "6"},
         {"ethDot1PTag", "0"}, {"dscpTag", "0"}}},

@@ -196,7 +196,7 @@ TEST_F(Actions, GreFailuresAreLoggedOrSilentAndThePacketsPass) {
   ASSERT_EQ(host::Sluice::Deliver(id_, *list_, 1), ZEL_OK);
   EXPECT_EQ(list_->Count(), 1u);
   EXPECT_TRUE(host::Sockets::Sent().empty());
-  EXPECT_EQ(ExactPkts(ExactTcp4("gre")), 8u);
+  EXPECT_EQ(ExactPkts(ExactTcp4("gre", 1234, 80, "raw")), 8u);
 }
 
 }  // namespace

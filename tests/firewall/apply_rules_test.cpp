@@ -146,7 +146,7 @@ TEST_F(ApplyTest, PoolTagsAreTakenOncePerEntryAndHandedBack) {
   EXPECT_EQ(host::ResPools::Outstanding(0xffff), 1);
 
   // A pool name filling the whole field without a NUL is cut at 128.
-  FWRule noNul = R("action=pooltag sport=9");
+  FWRule noNul = R("raw action=pooltag sport=9");
   std::memset(noNul.resourcePool, 'x', sizeof(noNul.resourcePool));
   ASSERT_EQ(Apply(rules::RulesetBuilder().Add(noNul).Bytes()), ZEL_OK);
   EXPECT_TRUE(host::Log::Contains("Invalid resource pool " + std::string(128, 'x') + " specified"));
@@ -158,7 +158,7 @@ TEST_F(ApplyTest, PoolTagsAreTakenOncePerEntryAndHandedBack) {
 TEST_F(ApplyTest, Version7ReadsBackAsSentButForItsCounters) {
   const std::string head = "ruleset version=7 features=0x1 frag=drop\n";
   const std::string general = "action=punt sa=10.0.0.0-10.0.0.255\n"
-                              "action=copy smac=02:00:00:00:00:01/00:00:00:00:00:00\n";
+                              "raw action=copy smac=02:00:00:00:00:01/00:00:00:00:00:00\n";
   ASSERT_EQ(Apply(Rs(head + Exact("pkts=3 bytes=5") + general)), ZEL_OK);
   ExactEntries()[0]->rule.pktCount = 4;
   ExactEntries()[0]->rule.byteCount = 60;

@@ -86,13 +86,13 @@ TEST_F(LookupTest, RangeBoundsPerFamily) {
   EXPECT_EQ(Action(Pkt("1.1.1.1", 1, "10.0.0.0", 1)), -1);
   EXPECT_EQ(Action(Pkt("1.1.1.1", 1, "11.0.0.5", 1)), -1);  // big-endian numbers
 
-  Load("action=drop da=2001:db8::1-2001:db8::9\n");
+  Load("action=drop da=2001:db8::1-<2001:db8::9\n");  // the wire bounds
   EXPECT_EQ(Action(Pkt("::1", 1, "2001:db8::1", 1)), 1);
   EXPECT_EQ(Action(Pkt("::1", 1, "2001:db8::8", 1)), 1);
   EXPECT_EQ(Action(Pkt("::1", 1, "2001:db8::9", 1)), -1);  // IPv6 upper bound excluded
   EXPECT_EQ(Action(Pkt("::1", 1, "2001:db7:ffff::5", 1)), -1);
 
-  Load("action=drop sa=!2001:db8::100-2001:db8:0:1::\n");
+  Load("action=drop sa=!2001:db8::100-<2001:db8:0:1::\n");
   EXPECT_EQ(Action(Pkt("2001:db8::ff", 1, "::2", 1)), 1);
   EXPECT_EQ(Action(Pkt("2001:db8::100", 1, "::2", 1)), -1);
   EXPECT_EQ(Action(Pkt("2001:db8::ffff:ffff:ffff", 1, "::2", 1)), -1);
@@ -125,12 +125,12 @@ TEST_F(LookupTest, MacMasksAndNegation) {
   Mac("02:11:22:00:00:01", p.dMac);
   EXPECT_EQ(Action(p), -1);
   // Version 7 has no mask: bit 22 compares under an all-zero mask.
-  Load("ruleset version=7\naction=punt smac=0e:0e:0e:0e:0e:0e/00:00:00:00:00:00\n");
+  Load("ruleset version=7\nraw action=punt smac=0e:0e:0e:0e:0e:0e/00:00:00:00:00:00\n");
   EXPECT_EQ(Action(p), SLCGenericActionPunt);
 }
 
 TEST_F(LookupTest, AddressFamilyMattersOnlyWhenAnAddressIsCompared) {
-  Load("action=drop ipv6 proto=6\n");  // both addresses wildcarded
+  Load("action=drop ipv6 ethtype=any proto=6\n");  // both addresses wildcarded
   EXPECT_EQ(Action(Pkt("1.1.1.1", 1, "2.2.2.2", 2)), 1);
   EXPECT_EQ(Action(Pkt("::1", 1, "::2", 2)), 1);
   Load("action=drop sa=2001:db8::1\n");
@@ -174,7 +174,7 @@ TEST_F(LookupTest, EarliestGeneralRuleWinsAcrossAddedRulesets) {
 // 2 still meets only rules of its own direction or of both.
 TEST_F(LookupTest, RemovedGeneralRuleStopsMatchingAndOthersKeepOrder) {
   Load("action=drop dport=80\n" "action=punt proto=6 sport=7\n" "action=copy dport=80\n"
-       "action=log dport=81 dir=7\n" "action=accept dport=81\n");
+       "raw action=log dport=81 dir=7\n" "action=accept dport=81\n");
   const ModelPacket p = Pkt("1.1.1.1", 7, "2.2.2.2", 80);
   EXPECT_EQ(Action(p), SLCGenericActionDrop);
   auto remove = [&](const char* line) {

@@ -12,6 +12,8 @@
 #include <iostream>
 #include <iterator>
 
+#include "tools/lib/ruleset_builder.h"
+
 namespace frames {
 
 namespace {
@@ -242,6 +244,77 @@ void PutBlock(Bytes* out, uint32_t type, const Bytes& body) {
 }
 
 }  // namespace
+
+bool TryParseMac(const std::string& text, MacAddr* mac) {
+  unsigned b[6];
+  char tail;
+  if (std::sscanf(text.c_str(), "%x:%x:%x:%x:%x:%x%c", &b[0], &b[1], &b[2], &b[3], &b[4], &b[5],
+                  &tail) != 6) {
+    return false;
+  }
+  for (int i = 0; i < 6; i++) {
+    if (b[i] > 0xff) return false;
+    (*mac)[i] = static_cast<uint8_t>(b[i]);
+  }
+  return true;
+}
+
+bool TryParseIp4(const std::string& text, Ip4Addr* ip) {
+  unsigned b[4];
+  char tail;
+  if (std::sscanf(text.c_str(), "%u.%u.%u.%u%c", &b[0], &b[1], &b[2], &b[3], &tail) != 4) {
+    return false;
+  }
+  for (int i = 0; i < 4; i++) {
+    if (b[i] > 0xff) return false;
+    (*ip)[i] = static_cast<uint8_t>(b[i]);
+  }
+  return true;
+}
+
+// An IPv6 literal through the rule syntax's own parser, so both accept the
+// same text.
+bool TryParseIp6(const std::string& text, Ip6Addr* ip) {
+  FWRule rule;
+  std::string error;
+  if (!rules::TryParseRule("ipv6 sa=" + text, &rule, &error)) return false;
+  std::copy(rule.ipSa, rule.ipSa + 16, ip->begin());
+  return true;
+}
+
+bool MakeDirectionRule(const std::string& direction, const std::string& vmMac,
+                       const std::string& vmIp, DirectionRule* rule, std::string* error) {
+  *rule = DirectionRule{};
+  if (direction == "from") {
+    rule->fixed = kDirectionFromSwitch;
+  } else if (direction == "to") {
+    rule->fixed = kDirectionToSwitch;
+  } else if (!direction.empty() && direction != "auto") {
+    *error = "--direction: not from, to or auto: " + direction;
+    return false;
+  }
+  if (!vmMac.empty()) {
+    MacAddr mac;
+    if (!TryParseMac(vmMac, &mac)) {
+      *error = "--vm-mac: not a MAC address: " + vmMac;
+      return false;
+    }
+    rule->vmMac = mac;
+  }
+  if (!vmIp.empty()) {
+    Ip4Addr ip4;
+    Ip6Addr ip6;
+    if (TryParseIp4(vmIp, &ip4)) {
+      rule->vmIp4 = ip4;
+    } else if (vmIp.find(':') != std::string::npos && TryParseIp6(vmIp, &ip6)) {
+      rule->vmIp6 = ip6;
+    } else {
+      *error = "--vm-ip: not an IPv4 or IPv6 address: " + vmIp;
+      return false;
+    }
+  }
+  return true;
+}
 
 std::optional<size_t> ResolveDirections(std::vector<CaptureRecord>* records,
                                         const DirectionRule& rule) {

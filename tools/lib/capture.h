@@ -61,6 +61,15 @@ struct DirectionRule {
   std::optional<Ip4Addr> vmIp4;
   std::optional<Ip6Addr> vmIp6;
 };
+// The rule the tools' --direction, --vm-mac and --vm-ip options give
+// (direction "from", "to", or "auto"/empty; an empty address is none).
+// False with a one-line reason naming the option when a text is malformed.
+bool MakeDirectionRule(const std::string& direction, const std::string& vmMac,
+                       const std::string& vmIp, DirectionRule* rule, std::string* error);
+// Literals of the command line; false when the text is not exactly one.
+bool TryParseMac(const std::string& text, MacAddr* mac);
+bool TryParseIp4(const std::string& text, Ip4Addr* ip);
+bool TryParseIp6(const std::string& text, Ip6Addr* ip);
 // Gives every record of direction 0 one by `rule`; returns the index of
 // the first record none applies to, or nullopt when all have one.
 std::optional<size_t> ResolveDirections(std::vector<CaptureRecord>* records,

@@ -1,182 +1,20 @@
-// Ruleset builder: text syntax <-> FWRule <-> wire rulesets. See the header
-// for the syntax.
+// Ruleset builder: rules from field values, rules and rulesets to text,
+// wire rulesets built and read back.
 
 #include "tools/lib/ruleset_builder.h"
 
-#include <arpa/inet.h>
-
-#include <array>
+#include <algorithm>
 #include <cctype>
 #include <charconv>
 #include <cstdio>
 #include <cstring>
+#include <optional>
+
+#include "tools/lib/rule_syntax.h"
 
 namespace rules {
 
-namespace {
-
-constexpr std::array<const char*, 12> kActionNames = {
-    "none", "drop", "accept", "punt", "copy", "l2rewrite",
-    "gre", "log", "pooltag", "dscp", "dot1p", "dscp+dot1p"};
-constexpr std::array<const char*, 4> kDirectionNames = {"invalid", "from", "to", "both"};
-
-struct ProtoName {
-  const char* name;
-  uint8_t value;
-};
-constexpr std::array<ProtoName, 4> kProtoNames = {
-    {{"tcp", 6}, {"udp", 17}, {"icmp", 1}, {"icmpv6", 58}}};
-
-[[noreturn]] void Fail(std::string_view key, std::string_view value, std::string_view why) {
-  std::string msg = "bad ";
-  msg.append(key);
-  if (!value.empty()) {
-    msg.append(" '");
-    msg.append(value);
-    msg.append("'");
-  }
-  msg.append(": ");
-  msg.append(why);
-  throw RuleError(msg);
-}
-
-uint64_t ParseNumber(std::string_view key, std::string_view text, uint64_t max) {
-  std::string_view digits = text;
-  int base = 10;
-  if (digits.size() > 2 && digits[0] == '0' && (digits[1] == 'x' || digits[1] == 'X')) {
-    digits.remove_prefix(2);
-    base = 16;
-  }
-  uint64_t v = 0;
-  auto [end, ec] = std::from_chars(digits.data(), digits.data() + digits.size(), v, base);
-  if (digits.empty() || ec != std::errc() || end != digits.data() + digits.size()) {
-    Fail(key, text, "not a number");
-  }
-  if (v > max) Fail(key, text, "out of range");
-  return v;
-}
-
-void ParseMac(std::string_view key, std::string_view text, uint8_t out[6]) {
-  if (text.size() != 17) Fail(key, text, "expected aa:bb:cc:dd:ee:ff");
-  for (int i = 0; i < 6; i++) {
-    if (i > 0 && text[i * 3 - 1] != ':') Fail(key, text, "expected aa:bb:cc:dd:ee:ff");
-    uint8_t b = 0;
-    auto [end, ec] = std::from_chars(text.data() + i * 3, text.data() + i * 3 + 2, b, 16);
-    if (ec != std::errc() || end != text.data() + i * 3 + 2) {
-      Fail(key, text, "expected aa:bb:cc:dd:ee:ff");
-    }
-    out[i] = b;
-  }
-}
-
-std::string FormatMac(const uint8_t mac[6]) {
-  char buf[18];
-  std::snprintf(buf, sizeof(buf), "%02x:%02x:%02x:%02x:%02x:%02x", mac[0], mac[1], mac[2],
-                mac[3], mac[4], mac[5]);
-  return buf;
-}
-
-// An address; returns true for IPv4 (4 bytes written), false for IPv6 (16).
-bool ParseAddr(std::string_view key, std::string_view text, uint8_t out[16]) {
-  std::string s(text);
-  if (s.find(':') != std::string::npos) {
-    if (inet_pton(AF_INET6, s.c_str(), out) != 1) Fail(key, text, "not an IPv6 address");
-    return false;
-  }
-  if (inet_pton(AF_INET, s.c_str(), out) != 1) Fail(key, text, "not an IPv4 address");
-  return true;
-}
-
-std::string FormatAddr(const uint8_t* addr, bool v4) {
-  char buf[INET6_ADDRSTRLEN];
-  inet_ntop(v4 ? AF_INET : AF_INET6, addr, buf, sizeof(buf));
-  return buf;
-}
-
-// Splits a leading '!' off `value`.
-bool TakeNegation(std::string_view* value) {
-  if (!value->empty() && value->front() == '!') {
-    value->remove_prefix(1);
-    return true;
-  }
-  return false;
-}
-
-// "a-b" into its two halves; false when there is no '-'.
-bool SplitRange(std::string_view value, std::string_view* lo, std::string_view* hi) {
-  const size_t dash = value.find('-');
-  if (dash == std::string_view::npos) return false;
-  *lo = value.substr(0, dash);
-  *hi = value.substr(dash + 1);
-  return true;
-}
-
-uint32_t ParseNamed(std::string_view key, std::string_view value, const char* const* names,
-                    size_t count, uint64_t max) {
-  for (size_t i = 0; i < count; i++) {
-    if (value == names[i]) return static_cast<uint32_t>(i);
-  }
-  return static_cast<uint32_t>(ParseNumber(key, value, max));
-}
-
-std::vector<std::string_view> Tokens(std::string_view line) {
-  const size_t hash = line.find('#');
-  if (hash != std::string_view::npos) line = line.substr(0, hash);
-  std::vector<std::string_view> out;
-  size_t i = 0;
-  while (i < line.size()) {
-    while (i < line.size() && std::isspace(static_cast<unsigned char>(line[i]))) i++;
-    size_t j = i;
-    while (j < line.size() && !std::isspace(static_cast<unsigned char>(line[j]))) j++;
-    if (j > i) out.push_back(line.substr(i, j - i));
-    i = j;
-  }
-  return out;
-}
-
-std::vector<std::string_view> Lines(std::string_view text) {
-  std::vector<std::string_view> out;
-  size_t start = 0;
-  while (start <= text.size()) {
-    size_t nl = text.find('\n', start);
-    if (nl == std::string_view::npos) nl = text.size();
-    out.push_back(text.substr(start, nl - start));
-    start = nl + 1;
-  }
-  return out;
-}
-
-void SplitToken(std::string_view token, std::string_view* key, std::string_view* value) {
-  const size_t eq = token.find('=');
-  if (eq == std::string_view::npos) {
-    *key = token;
-    *value = {};
-  } else {
-    *key = token.substr(0, eq);
-    *value = token.substr(eq + 1);
-  }
-}
-
-template <typename T>
-std::string Hex(T v) {
-  char buf[24];
-  std::snprintf(buf, sizeof(buf), "0x%llx", static_cast<unsigned long long>(v));
-  return buf;
-}
-
-}  // namespace
-
-// --- Names ------------------------------------------------------------------
-
-std::string ActionName(uint32_t action) {
-  if (action < kActionNames.size()) return kActionNames[action];
-  return std::to_string(action);
-}
-
-std::string DirectionName(uint8_t direction) {
-  if (direction < kDirectionNames.size()) return kDirectionNames[direction];
-  return std::to_string(direction);
-}
+using namespace syntax;
 
 // --- RuleBuilder ---------------------------------------------------------------
 
@@ -233,9 +71,75 @@ RuleBuilder& RuleBuilder::RawNegate(uint32_t negate) {
 }
 
 void RuleBuilder::SetFamily(Family f, std::string_view why) {
-  if (family_ != kUnset && family_ != f) Fail(why, {}, "conflicts with the rule's address family");
+  if (family_ != kUnset && family_ != f) {
+    Fail(std::string(why) + " is " + (f == kV4 ? "IPv4" : "IPv6") +
+         " but the rule is already " + (f == kV4 ? "IPv6" : "IPv4"));
+  }
   family_ = f;
 }
+
+namespace {
+
+// One address field value: A, A/LEN, A-B (inclusive), A-<B (IPv6, B
+// excluded as on the wire). Writes low and the wire's high bound.
+bool ParseAddressValue(std::string_view key, std::string_view value, uint8_t low[16],
+                       uint8_t high[16], bool* range) {
+  std::memset(low, 0, 16);
+  std::memset(high, 0, 16);
+  *range = false;
+  const size_t dash = value.find('-');
+  const size_t slash = value.find('/');
+  if (dash != std::string_view::npos) {
+    std::string_view lo = value.substr(0, dash), hi = value.substr(dash + 1);
+    const bool exclusive = !hi.empty() && hi.front() == '<';
+    if (exclusive) hi.remove_prefix(1);
+    const bool v4 = ParseAddr(key, lo, low);
+    if (ParseAddr(key, hi, high) != v4) {
+      Fail(std::string(key) + " range " + Quote(value) + " mixes IPv4 and IPv6");
+    }
+    *range = true;
+    if (v4) {
+      if (exclusive) Fail(std::string(key) + " '-<' (end excluded) is for IPv6 ranges only");
+      return true;
+    }
+    // IPv6 lookups exclude the upper bound; the text's end is included.
+    if (!exclusive && !AddrIncrement(high, 16)) {
+      Fail(std::string(key) + " range " + Quote(value) +
+           " ends at the last IPv6 address, which a range cannot include; end it at "
+           "ffff:ffff:ffff:ffff:ffff:ffff:ffff:fffe or write A-<ffff:ffff:ffff:ffff:ffff:ffff:ffff:ffff");
+    }
+    return false;
+  }
+  if (slash != std::string_view::npos) {
+    const bool v4 = ParseAddr(key, value.substr(0, slash), low);
+    const int bits = v4 ? 32 : 128;
+    const uint64_t len = ParseNumber(std::string(key) + " prefix length", value.substr(slash + 1),
+                                     static_cast<uint64_t>(bits));
+    const int n = v4 ? 4 : 16;
+    std::memcpy(high, low, n);
+    for (int b = static_cast<int>(len); b < bits; b++) {
+      const uint8_t bit = static_cast<uint8_t>(0x80u >> (b % 8));
+      if (low[b / 8] & bit) {
+        uint8_t net[16] = {};
+        std::memcpy(net, low, n);
+        for (int c = static_cast<int>(len); c < bits; c++) net[c / 8] &= ~(0x80u >> (c % 8));
+        Fail(std::string(key) + " " + Quote(value) + " has host bits set; did you mean " +
+             FormatAddr(net, v4) + "/" + std::to_string(len) + "?");
+      }
+      high[b / 8] |= bit;
+    }
+    *range = true;
+    if (!v4 && !AddrIncrement(high, 16)) {
+      Fail(std::string(key) + " " + Quote(value) +
+           " reaches the last IPv6 address, which a range cannot include; leave the field out "
+           "or write A-<ffff:ffff:ffff:ffff:ffff:ffff:ffff:ffff");
+    }
+    return v4;
+  }
+  return ParseAddr(key, value, low);
+}
+
+}  // namespace
 
 RuleBuilder& RuleBuilder::Set(std::string_view key, std::string_view value) {
   FWRule& r = rule_;
@@ -262,11 +166,11 @@ RuleBuilder& RuleBuilder::Set(std::string_view key, std::string_view value) {
     // Start from a wildcard, then narrow.
     r.ruleFlags = (r.ruleFlags | fb.wc) & ~fb.extra;
     r.negateFlags &= ~fb.neg;
-    if (wildcard) return *this;
-    if (value.empty()) Fail(key, value, "missing value");
+    if (key == "ethtype") ethTypeGiven_ = true;
+    if (wildcard || (key == "ethtype" && value == "any")) return *this;
+    if (value.empty()) Fail(std::string(key) + " needs a value");
     if (TakeNegation(&value)) r.negateFlags |= fb.neg;
     r.ruleFlags &= ~fb.wc;
-    std::string_view lo, hi;
     if (key == "dmac" || key == "smac") {
       const bool d = key == "dmac";
       std::string_view mac = value, mask;
@@ -274,7 +178,7 @@ RuleBuilder& RuleBuilder::Set(std::string_view key, std::string_view value) {
       if (slash != std::string_view::npos) {
         mac = value.substr(0, slash);
         mask = value.substr(slash + 1);
-        ParseMac(key, mask, d ? r.dMacMask : r.sMacMask);
+        ParseMac(std::string(key) + " mask", mask, d ? r.dMacMask : r.sMacMask);
         r.ruleFlags |= fb.extra;
       }
       ParseMac(key, mac, d ? r.dMac : r.sMac);
@@ -284,9 +188,9 @@ RuleBuilder& RuleBuilder::Set(std::string_view key, std::string_view value) {
       if (value == "none") {
         std::memset(r.vlan1QTag, 0, 4);
       } else if (value.substr(0, 4) == "raw:") {
+        if (value.size() != 12) Fail("vlan " + Quote(value) + " is not raw:XXXXXXXX (8 hex digits)");
         const uint32_t raw = static_cast<uint32_t>(
             ParseNumber(key, std::string("0x").append(value.substr(4)), 0xffffffffu));
-        if (value.size() != 12) Fail(key, value, "expected raw:XXXXXXXX");
         r.vlan1QTag[0] = static_cast<uint8_t>(raw >> 24);
         r.vlan1QTag[1] = static_cast<uint8_t>(raw >> 16);
         r.vlan1QTag[2] = static_cast<uint8_t>(raw >> 8);
@@ -299,25 +203,18 @@ RuleBuilder& RuleBuilder::Set(std::string_view key, std::string_view value) {
           prio = value.substr(slash + 1);
         }
         const uint16_t tci = static_cast<uint16_t>(
-            ParseNumber(key, vid, 4095) | (prio.empty() ? 0 : ParseNumber(key, prio, 7) << 13));
+            ParseNumber("vlan id", vid, 4095) |
+            (prio.empty() ? 0 : ParseNumber("vlan priority", prio, 7) << 13));
         r.vlan1QTag[0] = 0x81;
         r.vlan1QTag[1] = 0x00;
         FWPutNet16(r.vlan1QTag + 2, tci);
       }
     } else if (key == "sa" || key == "da") {
       const bool s = key == "sa";
-      uint8_t* low = s ? r.ipSa : r.ipDa;
-      uint8_t* high = s ? r.ipSaHigh : r.ipDaHigh;
-      std::memset(low, 0, 16);
-      std::memset(high, 0, 16);
-      bool v4;
-      if (SplitRange(value, &lo, &hi)) {
-        v4 = ParseAddr(key, lo, low);
-        if (ParseAddr(key, hi, high) != v4) Fail(key, value, "range mixes address families");
-        r.ruleFlags |= fb.extra;
-      } else {
-        v4 = ParseAddr(key, value, low);
-      }
+      bool range = false;
+      const bool v4 = ParseAddressValue(key, value, s ? r.ipSa : r.ipDa,
+                                        s ? r.ipSaHigh : r.ipDaHigh, &range);
+      if (range) r.ruleFlags |= fb.extra;
       SetFamily(v4 ? kV4 : kV6, key);
     } else if (key == "proto") {
       bool named = false;
@@ -327,15 +224,21 @@ RuleBuilder& RuleBuilder::Set(std::string_view key, std::string_view value) {
           named = true;
         }
       }
-      if (!named) r.ipProto = static_cast<uint8_t>(ParseNumber(key, value, 255));
+      if (!named) {
+        if (value.empty() || !std::isdigit(static_cast<unsigned char>(value[0]))) {
+          Fail("unknown protocol " + Quote(value) + DidYouMean(value, std::array{"tcp", "udp", "icmp", "icmpv6"}));
+        }
+        r.ipProto = static_cast<uint8_t>(ParseNumber(key, value, 255));
+      }
     } else {  // sport, dport
       const bool s = key == "sport";
       uint8_t* low = s ? r.sPort : r.dPort;
       uint8_t* high = s ? r.sPortHigh : r.dPortHigh;
       std::memset(high, 0, 2);
-      if (SplitRange(value, &lo, &hi)) {
-        FWPutNet16(low, static_cast<uint16_t>(ParseNumber(key, lo, 0xffff)));
-        FWPutNet16(high, static_cast<uint16_t>(ParseNumber(key, hi, 0xffff)));
+      const size_t dash = value.find('-');
+      if (dash != std::string_view::npos) {
+        FWPutNet16(low, static_cast<uint16_t>(ParseNumber(key, value.substr(0, dash), 0xffff)));
+        FWPutNet16(high, static_cast<uint16_t>(ParseNumber(key, value.substr(dash + 1), 0xffff)));
         r.ruleFlags |= fb.extra;
       } else {
         FWPutNet16(low, static_cast<uint16_t>(ParseNumber(key, value, 0xffff)));
@@ -344,14 +247,22 @@ RuleBuilder& RuleBuilder::Set(std::string_view key, std::string_view value) {
     return *this;
   }
 
+  auto named = [&](const auto& names, const char* what, uint64_t max) -> uint32_t {
+    for (size_t i = 0; i < names.size(); i++) {
+      if (value == names[i]) return static_cast<uint32_t>(i);
+    }
+    if (value.empty() || !std::isdigit(static_cast<unsigned char>(value[0]))) {
+      Fail(std::string("unknown ") + what + " " + Quote(value) + DidYouMean(value, names));
+    }
+    return static_cast<uint32_t>(ParseNumber(key, value, max));
+  };
   if (key == "action") {
-    r.action = ParseNamed(key, value, kActionNames.data(), kActionNames.size(), 0xffffffffu);
+    r.action = named(kActionNames, "action", 0xffffffffu);
   } else if (key == "dir") {
-    r.direction = static_cast<uint8_t>(
-        ParseNamed(key, value, kDirectionNames.data(), kDirectionNames.size(), 255));
+    r.direction = static_cast<uint8_t>(named(kDirectionNames, "direction", 255));
   } else if (key == "ipv4" || key == "ipv6") {
-    if (!value.empty()) Fail(key, value, "takes no value");
-    if (familyExplicit_) Fail(key, {}, "address family given twice");
+    if (!value.empty()) Fail(std::string(key) + " takes no value");
+    if (familyExplicit_) Fail("address family given twice");
     SetFamily(key == "ipv4" ? kV4 : kV6, key);
     familyExplicit_ = true;
   } else if (key == "rptag") {
@@ -368,12 +279,14 @@ RuleBuilder& RuleBuilder::Set(std::string_view key, std::string_view value) {
     ParseMac(key, value, r.rewriteMac);
   } else if (key == "gre") {
     uint8_t addr[16] = {};
-    if (!ParseAddr(key, value, addr)) Fail(key, value, "GRE destination must be IPv4");
+    if (!ParseAddr(key, value, addr)) Fail("gre " + Quote(value) + ": the GRE destination must be IPv4");
     std::memcpy(r.greIP, addr, 4);
   } else if (key == "snaplen") {
     r.snapLen = static_cast<uint32_t>(ParseNumber(key, value, 0xffffffffu));
   } else if (key == "pool") {
-    if (value.size() >= sizeof(r.resourcePool)) Fail(key, value, "longer than 127 characters");
+    if (value.size() >= sizeof(r.resourcePool)) {
+      Fail("pool name is " + std::to_string(value.size()) + " characters long; at most 127 fit");
+    }
     std::memset(r.resourcePool, 0, sizeof(r.resourcePool));
     std::memcpy(r.resourcePool, value.data(), value.size());
   } else if (key == "dot1p") {
@@ -388,8 +301,23 @@ RuleBuilder& RuleBuilder::Set(std::string_view key, std::string_view value) {
     RawFlags(static_cast<uint32_t>(ParseNumber(key, value, 0xffffffffu)));
   } else if (key == "rawneg") {
     RawNegate(static_cast<uint32_t>(ParseNumber(key, value, 0xffffffffu)));
+  } else if (key == "wire") {
+    if (value.size() != 2 * FW_RULE_SIZE_V7 && value.size() != 2 * FW_RULE_SIZE_V8) {
+      Fail("wire takes the whole record: " + std::to_string(2 * FW_RULE_SIZE_V7) + " or " +
+           std::to_string(2 * FW_RULE_SIZE_V8) + " hex digits, not " + std::to_string(value.size()));
+    }
+    wire_.assign(value.size() / 2, 0);
+    for (size_t i = 0; i < wire_.size(); i++) {
+      auto [end, ec] = std::from_chars(value.data() + 2 * i, value.data() + 2 * i + 2, wire_[i], 16);
+      if (ec != std::errc() || end != value.data() + 2 * i + 2) {
+        Fail("wire: '" + std::string(value.substr(2 * i, 2)) + "' at digit " + std::to_string(2 * i + 1) +
+             " is not hex");
+      }
+    }
+  } else if (key == "exact" || key == "raw") {
+    // Markers for the text checks; they change no byte.
   } else {
-    Fail("key", key, "unknown field");
+    Fail("unknown field " + Quote(key) + DidYouMean(key, kRuleKeys));
   }
   return *this;
 }
@@ -401,43 +329,84 @@ FWRule RuleBuilder::Build() const {
   } else {
     r.ruleFlags |= FW_FLAG_IPV4;
   }
+  if (familyExplicit_ && !ethTypeGiven_) {
+    r.ruleFlags &= ~FW_WC_ETHTYPE;
+    r.negateFlags &= ~FW_NEG_ETHTYPE;
+    FWPutNet16(r.ethType, family_ == kV6 ? 0x86dd : 0x0800);
+  }
   if (rawFlags_) r.ruleFlags = rawFlagsValue_;
   if (rawNeg_) r.negateFlags = rawNegValue_;
+  if (!wire_.empty()) {
+    std::memset(&r, 0, sizeof(r));
+    std::memcpy(&r, wire_.data(), std::min(wire_.size(), sizeof(r)));
+  }
   return r;
-}
-
-FWRule ParseRule(std::string_view line) {
-  RuleBuilder b;
-  for (std::string_view token : Tokens(line)) {
-    std::string_view key, value;
-    SplitToken(token, &key, &value);
-    b.Set(key, value);
-  }
-  return b.Build();
-}
-
-bool TryParseRule(std::string_view line, FWRule* rule, std::string* error) {
-  try {
-    *rule = ParseRule(line);
-    return true;
-  } catch (const RuleError& e) {
-    if (error) *error = e.what();
-    return false;
-  }
 }
 
 // --- Formatting -------------------------------------------------------------------
 
 namespace {
 
-std::string FormatRuleFields(const FWRule& r, uint8_t version) {
+// "A/LEN" when lo..hi (inclusive) is exactly one prefix, else "".
+std::string AsPrefix(unsigned __int128 lo, unsigned __int128 hi, int bits, bool v4) {
+  const unsigned __int128 host = lo ^ hi;
+  if ((host & (host + 1)) != 0 || (lo & host) != 0 || lo > hi) return {};
+  int len = bits;
+  for (unsigned __int128 h = host; h; h >>= 1) len--;
+  uint8_t a[16] = {};
+  const int n = v4 ? 4 : 16;
+  for (int i = n - 1; i >= 0; i--, lo >>= 8) a[i] = static_cast<uint8_t>(lo);
+  return FormatAddr(a, v4) + "/" + std::to_string(len);
+}
+
+std::string FormatAddressField(const uint8_t* lo, const uint8_t* hi, bool range, bool v4) {
+  if (!range) return FormatAddr(lo, v4);
+  const int n = v4 ? 4 : 16;
+  uint8_t end[16] = {};
+  std::memcpy(end, hi, n);
+  if (!v4 && !AddrDecrement(end, 16)) return FormatAddr(lo, v4) + "-<" + FormatAddr(hi, v4);
+  const std::string prefix = AsPrefix(AddrValue(lo, n), AddrValue(end, n), n * 8, v4);
+  if (!prefix.empty()) return prefix;
+  return FormatAddr(lo, v4) + "-" + FormatAddr(end, v4);
+}
+
+bool PoolIsText(const FWRule& r) {
+  const size_t len = strnlen(r.resourcePool, sizeof(r.resourcePool));
+  if (len == sizeof(r.resourcePool)) return false;
+  for (size_t i = 0; i < sizeof(r.resourcePool); i++) {
+    const char c = r.resourcePool[i];
+    if (i >= len ? c != 0 : (!std::isgraph(static_cast<unsigned char>(c)) || c == '#')) return false;
+  }
+  return true;
+}
+
+std::string FormatRuleFields(const FWRule& r, uint8_t version, bool raw) {
   const uint32_t f = r.ruleFlags;
   const uint32_t n = r.negateFlags;
   const bool v4 = (f & FW_FLAG_IPV4) != 0;
-  std::string out = "action=" + ActionName(r.action) + " dir=" + DirectionName(r.direction) +
-                    (v4 ? " ipv4" : " ipv6");
+  const bool v8 = version >= FW_RULESET_VERSION_8;
+  std::string out = raw ? "raw " : "";
+  out += "action=" + ActionName(r.action);
+  if (r.direction != SLCGenericDirectionBidirectional) out += " dir=" + DirectionName(r.direction);
   auto neg = [&](uint32_t bit) { return (n & bit) ? "!" : ""; };
 
+  const bool hasAddr = !(f & FW_WC_IPSA) || !(f & FW_WC_IPDA);
+  const bool ethWild = (f & FW_WC_ETHTYPE) != 0;
+  const uint16_t famType = v4 ? 0x0800 : 0x86dd;
+  const bool ethIsFamily = !ethWild && !(n & FW_NEG_ETHTYPE) && FWNet16(r.ethType) == famType;
+  std::string eth;
+  if (!ethWild) {
+    char buf[8];
+    std::snprintf(buf, sizeof(buf), "0x%04x", FWNet16(r.ethType));
+    eth = std::string(" ethtype=") + neg(FW_NEG_ETHTYPE) + buf;
+  }
+  if (ethIsFamily) {
+    out += v4 ? " ipv4" : " ipv6";
+  } else if (!v4 && !hasAddr) {
+    out += " ipv6" + (ethWild ? std::string(" ethtype=any") : eth);
+  } else {
+    out += eth;
+  }
   if (!(f & FW_WC_DMAC)) {
     out += std::string(" dmac=") + neg(FW_NEG_DMAC) + FormatMac(r.dMac);
     if (f & FW_MASK_DMAC) out += "/" + FormatMac(r.dMacMask);
@@ -445,11 +414,6 @@ std::string FormatRuleFields(const FWRule& r, uint8_t version) {
   if (!(f & FW_WC_SMAC)) {
     out += std::string(" smac=") + neg(FW_NEG_SMAC) + FormatMac(r.sMac);
     if (f & FW_MASK_SMAC) out += "/" + FormatMac(r.sMacMask);
-  }
-  if (!(f & FW_WC_ETHTYPE)) {
-    char buf[8];
-    std::snprintf(buf, sizeof(buf), "0x%04x", FWNet16(r.ethType));
-    out += std::string(" ethtype=") + neg(FW_NEG_ETHTYPE) + buf;
   }
   if (!(f & FW_WC_VLAN)) {
     out += std::string(" vlan=") + neg(FW_NEG_VLAN);
@@ -466,15 +430,19 @@ std::string FormatRuleFields(const FWRule& r, uint8_t version) {
     }
   }
   if (!(f & FW_WC_IPSA)) {
-    out += std::string(" sa=") + neg(FW_NEG_IPSA) + FormatAddr(r.ipSa, v4);
-    if (f & FW_RANGE_IPSA) out += "-" + FormatAddr(r.ipSaHigh, v4);
+    out += std::string(" sa=") + neg(FW_NEG_IPSA) +
+           FormatAddressField(r.ipSa, r.ipSaHigh, (f & FW_RANGE_IPSA) != 0, v4);
   }
   if (!(f & FW_WC_IPDA)) {
-    out += std::string(" da=") + neg(FW_NEG_IPDA) + FormatAddr(r.ipDa, v4);
-    if (f & FW_RANGE_IPDA) out += "-" + FormatAddr(r.ipDaHigh, v4);
+    out += std::string(" da=") + neg(FW_NEG_IPDA) +
+           FormatAddressField(r.ipDa, r.ipDaHigh, (f & FW_RANGE_IPDA) != 0, v4);
   }
   if (!(f & FW_WC_IPPROTO)) {
-    out += std::string(" proto=") + neg(FW_NEG_IPPROTO) + std::to_string(r.ipProto);
+    std::string proto = std::to_string(r.ipProto);
+    for (const ProtoName& p : kProtoNames) {
+      if (p.value == r.ipProto) proto = p.name;
+    }
+    out += std::string(" proto=") + neg(FW_NEG_IPPROTO) + proto;
   }
   if (!(f & FW_WC_SPORT)) {
     out += std::string(" sport=") + neg(FW_NEG_SPORT) + std::to_string(FWNet16(r.sPort));
@@ -484,19 +452,23 @@ std::string FormatRuleFields(const FWRule& r, uint8_t version) {
     out += std::string(" dport=") + neg(FW_NEG_DPORT) + std::to_string(FWNet16(r.dPort));
     if (f & FW_RANGE_DPORT) out += "-" + std::to_string(FWNet16(r.dPortHigh));
   }
-  if (version >= FW_RULESET_VERSION_8 && !(f & FW_WC_RPTAG)) {
-    out += " rptag=" + std::to_string(r.rpTag);
-  }
-  if (r.bidirectional) out += " bidir=" + std::to_string(r.bidirectional);
+  if (v8 && !(f & FW_WC_RPTAG)) out += " rptag=" + std::to_string(r.rpTag);
+  if (r.bidirectional == 1) out += " bidir";
+  if (r.bidirectional > 1) out += " bidir=" + std::to_string(r.bidirectional);
   static constexpr uint8_t kZeroMac[6] = {};
-  if (std::memcmp(r.rewriteMac, kZeroMac, 6) != 0) out += " rewrite=" + FormatMac(r.rewriteMac);
-  if (FWNet32(r.greIP) != 0) out += " gre=" + FormatAddr(r.greIP, true);
+  const uint32_t a = r.action;
+  if (ActionUses(a, "rewrite") || std::memcmp(r.rewriteMac, kZeroMac, 6) != 0) {
+    out += " rewrite=" + FormatMac(r.rewriteMac);
+  }
+  if (ActionUses(a, "gre") || FWNet32(r.greIP) != 0) out += " gre=" + FormatAddr(r.greIP, true);
   if (r.snapLen) out += " snaplen=" + std::to_string(r.snapLen);
   const size_t poolLen = strnlen(r.resourcePool, sizeof(r.resourcePool));
-  if (poolLen > 0) out += " pool=" + std::string(r.resourcePool, poolLen);
-  if (version >= FW_RULESET_VERSION_8) {
-    if (r.ethDot1PTag) out += " dot1p=" + std::to_string(r.ethDot1PTag);
-    if (r.dscpTag) out += " dscp=" + std::to_string(r.dscpTag);
+  if ((ActionUses(a, "pool") || poolLen > 0) && PoolIsText(r)) {
+    out += " pool=" + std::string(r.resourcePool, poolLen);
+  }
+  if (v8) {
+    if (ActionUses(a, "dot1p") || r.ethDot1PTag) out += " dot1p=" + std::to_string(r.ethDot1PTag);
+    if (ActionUses(a, "dscp") || r.dscpTag) out += " dscp=" + std::to_string(r.dscpTag);
   }
   if (r.pktCount) out += " pkts=" + std::to_string(r.pktCount);
   if (r.byteCount) out += " bytes=" + std::to_string(r.byteCount);
@@ -506,16 +478,38 @@ std::string FormatRuleFields(const FWRule& r, uint8_t version) {
 }  // namespace
 
 std::string FormatRule(const FWRule& rule, uint8_t version) {
-  std::string out = FormatRuleFields(rule, version);
-  // Flags the readable fields do not express (unknown bits, negation or
-  // mask bits on wildcarded fields) are added raw so the text reads back
-  // to the same record. Bit 9 does not exist on the version-7 wire.
-  FWRule back = ParseRule(out);
+  // The checked language first; a record it cannot say (or says
+  // differently) is written raw with what the fields do not express (unknown
+  // flag bits, negation or mask bits on wildcarded fields) added as raw
+  // flags, so the text always reads back to the same record.
+  const std::string plain = FormatRuleFields(rule, version, false);
+  if (PoolIsText(rule)) {
+    std::optional<FWRule> back = ReadRuleText(plain, version);
+    if (back && SameRecord(*back, rule, version)) return plain;
+  }
+  std::string out = FormatRuleFields(rule, version, true);
+  std::optional<FWRule> back = ReadRuleText(out, version);
   const uint32_t ignore = version < FW_RULESET_VERSION_8 ? FW_WC_RPTAG : 0;
-  if ((back.ruleFlags & ~ignore) != (rule.ruleFlags & ~ignore)) {
+  if (back && (back->ruleFlags & ~ignore) != (rule.ruleFlags & ~ignore)) {
     out += " rawflags=" + Hex(rule.ruleFlags);
   }
-  if (back.negateFlags != rule.negateFlags) out += " rawneg=" + Hex(rule.negateFlags);
+  if (back && back->negateFlags != rule.negateFlags) out += " rawneg=" + Hex(rule.negateFlags);
+  // Bytes no field shows (values under a wildcard, the unused tail of an
+  // IPv4 address, a bound without its range bit) come from senders that
+  // did not start from text; the whole record then follows in hex.
+  back = ReadRuleText(out, version);
+  if (!back || !SameRecord(*back, rule, version)) {
+    const size_t size = version == FW_RULESET_VERSION_7 ? FW_RULE_SIZE_V7 : FW_RULE_SIZE_V8;
+    FWRule w = rule;
+    if (version == FW_RULESET_VERSION_7) w.ruleFlags &= ~FW_WC_RPTAG;
+    const uint8_t* p = reinterpret_cast<const uint8_t*>(&w);
+    out += " wire=";
+    for (size_t i = 0; i < size; i++) {
+      char buf[3];
+      std::snprintf(buf, sizeof(buf), "%02x", p[i]);
+      out += buf;
+    }
+  }
   return out;
 }
 
@@ -542,31 +536,12 @@ RulesetBuilder& RulesetBuilder::Add(const FWRule& rule) {
 RulesetBuilder& RulesetBuilder::Add(std::string_view line) { return Add(ParseRule(line)); }
 
 RulesetBuilder& RulesetBuilder::AddText(std::string_view text) {
-  bool sawRule = false;
-  for (std::string_view line : Lines(text)) {
-    std::vector<std::string_view> tokens = Tokens(line);
-    if (tokens.empty()) continue;
-    if (tokens[0] != "ruleset") {
-      Add(line);
-      sawRule = true;
-      continue;
-    }
-    if (sawRule) Fail("ruleset", {}, "header line must come before the rules");
-    for (size_t i = 1; i < tokens.size(); i++) {
-      std::string_view key, value;
-      SplitToken(tokens[i], &key, &value);
-      if (key == "version") {
-        version_ = static_cast<uint8_t>(ParseNumber(key, value, 255));
-      } else if (key == "features") {
-        features_ = static_cast<uint32_t>(ParseNumber(key, value, 0xffffffffu));
-      } else if (key == "frag") {
-        fragOverride_ =
-            ParseNamed(key, value, kActionNames.data(), kActionNames.size(), 0xffffffffu);
-      } else {
-        Fail("ruleset key", key, "unknown");
-      }
-    }
-  }
+  RulesetText t = ReadRulesetText(text);
+  if (!t.Ok()) throw RuleError(RenderDiagnostics("", t.diagnostics));
+  version_ = t.version;
+  features_ = t.features;
+  fragOverride_ = t.fragOverride;
+  for (const TextRule& r : t.rules) rules_.push_back(r.rule);
   return *this;
 }
 
@@ -577,7 +552,7 @@ std::vector<uint8_t> RulesetBuilder::Bytes() const {
   } else if (version_ == FW_RULESET_VERSION_8) {
     size = FW_RULE_SIZE_V8;
   } else {
-    Fail("version", std::to_string(version_), "only 7 and 8 can be built");
+    Fail("ruleset version " + std::to_string(version_) + " is not 7 or 8");
   }
   std::vector<uint8_t> out(FW_RULESET_HEADER_SIZE + rules_.size() * size);
   FWRulesetHeader h{};
@@ -595,7 +570,7 @@ std::vector<uint8_t> RulesetBuilder::Bytes() const {
       const uint8_t* bytes = reinterpret_cast<const uint8_t*>(&r);
       for (uint32_t b = FW_RULE_SIZE_V7; b < FW_RULE_SIZE_V8; b++) {
         if (bytes[b] != 0) {
-          Fail("rule", std::to_string(i), "uses version-8 fields in a version-7 ruleset");
+          Fail("rule " + std::to_string(i + 1) + " uses version-8 fields in a version-7 ruleset");
         }
       }
       r.ruleFlags &= ~FW_WC_RPTAG;
@@ -606,7 +581,9 @@ std::vector<uint8_t> RulesetBuilder::Bytes() const {
 }
 
 DecodedRuleset DecodeRuleset(std::span<const uint8_t> bytes) {
-  if (bytes.size() < FW_RULESET_HEADER_SIZE) Fail("ruleset", {}, "shorter than its header");
+  if (bytes.size() < FW_RULESET_HEADER_SIZE) {
+    Fail("ruleset of " + std::to_string(bytes.size()) + " bytes is shorter than its 15-byte header");
+  }
   FWRulesetHeader h;
   std::memcpy(&h, bytes.data(), sizeof(h));
   uint32_t size;
@@ -615,10 +592,11 @@ DecodedRuleset DecodeRuleset(std::span<const uint8_t> bytes) {
   } else if (h.version == FW_RULESET_VERSION_8) {
     size = FW_RULE_SIZE_V8;
   } else {
-    Fail("ruleset version", std::to_string(h.version), "not 7 or 8");
+    Fail("ruleset version " + std::to_string(h.version) + " is not 7 or 8");
   }
   if (bytes.size() != FW_RULESET_HEADER_SIZE + static_cast<uint64_t>(h.numRules) * size) {
-    Fail("ruleset length", std::to_string(bytes.size()), "does not match numRules");
+    Fail("ruleset length " + std::to_string(bytes.size()) + " does not match its " +
+         std::to_string(h.numRules) + " rules of " + std::to_string(size) + " bytes");
   }
   DecodedRuleset out;
   out.version = h.version;
@@ -636,10 +614,25 @@ DecodedRuleset DecodeRuleset(std::span<const uint8_t> bytes) {
 
 std::string FormatRuleset(std::span<const uint8_t> bytes) {
   DecodedRuleset d = DecodeRuleset(bytes);
-  std::string out = "ruleset version=" + std::to_string(d.version) +
-                    " features=" + Hex(d.fwFeatures) + " frag=" + ActionName(d.fragOverride) +
-                    "\n";
-  for (const FWRule& r : d.rules) out += FormatRule(r, d.version) + "\n";
+  std::string out = "ruleset version=" + std::to_string(d.version);
+  const bool rawHeader = (d.fwFeatures & ~(FW_FEATURE_DROP_BPDU | FW_FEATURE_DROP_DHCP_SERVER)) ||
+                         d.fragOverride >= kActionNames.size();
+  if (d.fwFeatures) out += " features=" + FeatureNames(d.fwFeatures);
+  if (d.fragOverride) out += " frag=" + ActionName(d.fragOverride);
+  if (rawHeader) out += " raw";
+  out += "\n";
+  for (size_t i = 0; i < d.rules.size(); i++) {
+    const FWRule& r = d.rules[i];
+    if (i + 1 == d.rules.size()) {
+      const uint32_t a = r.action;
+      if ((a == SLCGenericActionAccept || a == SLCGenericActionDrop || a == SLCGenericActionPunt) &&
+          SameRecord(r, DefaultRule(a), d.version)) {
+        out += "default=" + ActionName(a) + "\n";
+        break;
+      }
+    }
+    out += FormatRule(r, d.version) + "\n";
+  }
   return out;
 }
 

@@ -4,58 +4,27 @@
 // the 281-byte version-8 form; a RulesetBuilder writes version-7 or
 // version-8 wire rulesets, DecodeRuleset/FormatRuleset read them back.
 //
-// Text syntax
-// -----------
-// One rule per line, whitespace-separated tokens; '#' starts a comment,
-// blank lines are skipped. A field that is not mentioned, or is given as
-// '*', is a wildcard. A value may start with '!' to negate the field.
+// The rule text language is documented in the README ("Rule syntax") and
+// by `sluice-rules --help`; kRuleSyntaxHelp below is that reference.
 //
-//   action=NAME|N   none drop accept punt copy l2rewrite gre log pooltag dscp
-//                   dot1p dscp+dot1p (default: accept)
-//   dir=D           from (1), to (2), both (3), invalid (0) or a number
-//                   (default: both)
-//   ipv4 | ipv6     address family (default: taken from sa/da, else ipv4)
-//   dmac=[!]MAC[/MASK]   destination MAC aa:bb:cc:dd:ee:ff; /MASK compares
-//   smac=[!]MAC[/MASK]   under the mask (ruleFlags bit 21 / 22)
-//   ethtype=[!]N    ethertype, 0x0800 or 2048
-//   vlan=[!]V       none (00 00 00 00), VID or VID/PRIO (81 00 + TCI),
-//                   raw:XXXXXXXX (4 bytes in hex)
-//   sa=[!]A[-B]     source address or inclusive range (IPv4 10.0.0.1,
-//   da=[!]A[-B]     IPv6 2001:db8::1; IPv6 range ends are exclusive in lookup)
-//   proto=[!]P      IP protocol: number, tcp, udp, icmp, icmpv6
-//   sport=[!]N[-M]  source port or inclusive range
-//   dport=[!]N[-M]  destination port or inclusive range
-//   rptag=N         resource-pool tag to match (version 8); omitted = any
-//   bidir[=N]       bidirectional flag; bare 'bidir' means 1 (install mirror)
-//   rewrite=MAC     L2 rewrite address
-//   gre=A.B.C.D     GRE destination
-//   snaplen=N       GRE snap length
-//   pool=NAME       resource-pool name (no whitespace, at most 127 chars)
-//   dot1p=N dscp=N  marking values (version 8)
-//   pkts=N bytes=N  counters carried in the record
-//   rawflags=N      ruleFlags exactly (overrides what the fields produced)
-//   rawneg=N        negateFlags exactly
+// Two layers:
+//  - RuleBuilder sets fields one at a time and checks only that each value
+//    fits its wire field. Tests use it to build records the text language
+//    refuses on purpose.
+//  - ReadRulesetText reads a whole ruleset text, checks every rule against
+//    what the module will do with it (ranges, action parameters, version,
+//    exact or general) and reports every error with line and column.
+//    ParseRuleset, TryParseRuleset, ParseRule and TryParseRule go through it.
 //
-// Example:
-//   action=drop dir=to ipv4 proto=6 sa=10.0.0.1 da=10.0.0.2 sport=1234 dport=80
+// rule_text.cpp reads texts, ruleset_builder.cpp builds, formats and
+// decodes, rule_syntax.{h,cpp} holds what both share.
 //
-// A rule is exact (hash table) when it wildcards none of dmac, smac,
-// ethtype, vlan, sa, da, proto, sport, dport and has no range or mask;
-// otherwise it is general (ordered list).
-//
-// A ruleset text may hold one header line before its rules:
-//   ruleset version=7|8 features=N frag=ACTION
-// (defaults: version 8, features 0, frag none).
-//
-// Version 7 records have no rptag, dot1p, dscp, masks or negation: building
-// a version-7 ruleset from a rule that sets any of those bytes fails. The
-// rpTag wildcard bit (ruleFlags bit 9) is written clear in version-7 records,
-// as the module writes them.
-//
-// Errors: parsing and building throw RuleError with a message naming the
-// offending token; the Try* functions return false with the message instead.
+// FormatRule/FormatRuleset print the checked language whenever the record
+// can be said in it, and otherwise the rule marked `raw`, where the value
+// checks are off; either way the text compiles back to the same bytes.
 #pragma once
 
+#include <cstddef>
 #include <cstdint>
 #include <span>
 #include <stdexcept>
@@ -72,8 +41,11 @@ class RuleError : public std::runtime_error {
   using std::runtime_error::runtime_error;
 };
 
+// Reference of the rule text syntax (README table in plain text).
+extern const char kRuleSyntaxHelp[];
+
 // Builds one rule from readable field values; every setter takes the value
-// part of the text syntax above ("10.0.0.1-10.0.0.9", "!80", "02:..:ff/ff:..").
+// part of the text syntax ("10.0.0.1-10.0.0.9", "!80", "02:..:ff/ff:..").
 class RuleBuilder {
  public:
   RuleBuilder();
@@ -82,6 +54,8 @@ class RuleBuilder {
   RuleBuilder& Action(uint32_t action);
   RuleBuilder& Dir(std::string_view v) { return Set("dir", v); }
   RuleBuilder& Dir(uint8_t direction);
+  // The address family; also matches the family's ethertype unless the rule
+  // sets ethtype itself (ethtype=any keeps it a wildcard).
   RuleBuilder& Ipv4() { return Set("ipv4", {}); }
   RuleBuilder& Ipv6() { return Set("ipv6", {}); }
   RuleBuilder& DMac(std::string_view v) { return Set("dmac", v); }
@@ -110,6 +84,7 @@ class RuleBuilder {
   RuleBuilder& RawNegate(uint32_t negate);
 
   // One field of the text syntax; `key` without '=' takes an empty value.
+  // Throws RuleError when the value does not fit the field.
   RuleBuilder& Set(std::string_view key, std::string_view value);
 
   // The finished rule (version-8 form). May be called more than once.
@@ -122,13 +97,62 @@ class RuleBuilder {
   FWRule rule_;
   Family family_ = kUnset;
   bool familyExplicit_ = false;
+  bool ethTypeGiven_ = false;
   bool rawFlags_ = false;
   bool rawNeg_ = false;
   uint32_t rawFlagsValue_ = 0;
   uint32_t rawNegValue_ = 0;
+  std::vector<uint8_t> wire_;  // a whole record given as wire=HEX
 };
 
-// One line of the text syntax (comments allowed) to a rule.
+// One error found in a ruleset text. Lines and columns count from 1;
+// columns are bytes. `width` is how many bytes the caret underlines.
+struct Diagnostic {
+  size_t line = 0;
+  size_t column = 0;
+  size_t width = 1;
+  std::string message;
+  std::string note;    // valid names and the like; may be empty
+  std::string source;      // the line, or a window of a long line
+  size_t sourceColumn = 1;  // column of the line where `source` starts
+};
+
+// "FILE:LINE:COL: error: MESSAGE", the line, a caret line and the note, for
+// each diagnostic. `file` may be empty.
+std::string RenderDiagnostics(std::string_view file, const std::vector<Diagnostic>& diags);
+
+// One rule read from text.
+struct TextRule {
+  FWRule rule;
+  size_t line = 0;          // 1-based line in the text
+  bool exactAsked = false;  // the rule said `exact`
+  bool isDefault = false;   // from the `default=` line
+};
+
+struct RulesetText {
+  uint8_t version = FW_RULESET_VERSION_8;
+  uint32_t features = 0;
+  uint32_t fragOverride = 0;
+  std::vector<TextRule> rules;
+  std::vector<Diagnostic> diagnostics;  // empty when the text is good
+  bool Ok() const { return diagnostics.empty(); }
+};
+
+// Limits on ruleset texts: longer lines, more rules or more errors end the
+// reading with an error instead of growing without bound.
+inline constexpr size_t kMaxLineLength = 4096;
+inline constexpr size_t kMaxRules = 1u << 18;
+inline constexpr size_t kMaxDiagnostics = 50;
+
+// Reads a ruleset text: an optional header line
+//   ruleset version=7|8 features=NAMES frag=ACTION
+// rule lines, and an optional last line default=accept|drop|punt.
+RulesetText ReadRulesetText(std::string_view text);
+// The wire ruleset of a text read without errors.
+std::vector<uint8_t> RulesetBytes(const RulesetText& text);
+
+// One line of the text syntax (comments allowed) to a rule, with the checks
+// of a version-8 ruleset.
 FWRule ParseRule(std::string_view line);
 bool TryParseRule(std::string_view line, FWRule* rule, std::string* error);
 
@@ -140,10 +164,15 @@ std::string FormatRule(const FWRule& rule, uint8_t version = FW_RULESET_VERSION_
 inline bool IsExactRule(const FWRule& rule) {
   return (rule.ruleFlags & FW_GENERAL_RULE_MASK) == 0;
 }
+// Why a rule is general: one phrase per field that is wildcarded, a range
+// or masked ("sport wildcard", "sa range"). Empty for an exact rule.
+std::vector<std::string> GeneralReasons(const FWRule& rule);
 
 // Action and direction names as the text syntax uses them.
 std::string ActionName(uint32_t action);
 std::string DirectionName(uint8_t direction);
+// "drop-bpdu,drop-dhcp-server", "none", unknown bits in hex.
+std::string FeatureNames(uint32_t features);
 
 class RulesetBuilder {
  public:
@@ -154,7 +183,8 @@ class RulesetBuilder {
   RulesetBuilder& FragOverride(uint32_t action);
   RulesetBuilder& Add(const FWRule& rule);
   RulesetBuilder& Add(std::string_view line);    // one rule line
-  // Several lines of rules (and an optional header line).
+  // A whole ruleset text (header and default line allowed); throws
+  // RuleError with the rendered diagnostics when it has errors.
   RulesetBuilder& AddText(std::string_view text);
 
   const std::vector<FWRule>& Rules() const { return rules_; }
@@ -183,9 +213,11 @@ struct DecodedRuleset {
 // Throws RuleError unless version is 7 or 8 and the length is exactly
 // 15 + numRules * size(version).
 DecodedRuleset DecodeRuleset(std::span<const uint8_t> bytes);
-// The whole ruleset as text: a header line, then one rule line each.
+// The whole ruleset as text: a header line, then one rule line each, the
+// last rule as a default= line when it is a plain catch-all.
 std::string FormatRuleset(std::span<const uint8_t> bytes);
-// Ruleset text (header line optional) to wire bytes.
+// Ruleset text to wire bytes; the error (and RuleError's message) is the
+// rendered diagnostics of every error in the text.
 std::vector<uint8_t> ParseRuleset(std::string_view text);
 bool TryParseRuleset(std::string_view text, std::vector<uint8_t>* bytes, std::string* error);
 
