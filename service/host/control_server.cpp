@@ -309,7 +309,13 @@ Message ControlServer::Device(const Message& req) {
     if (!StringArg(req.args, "agent", &agent, 99, &error)) return Fail(error);
   } else {
     std::lock_guard<std::mutex> g(mu_);
+    // The agent of the port named, or of the port with that VM and vNIC.
     auto it = filterName.empty() ? ports_.end() : ports_.find(filterName);
+    if (it == ports_.end() && !uuid.empty()) {
+      for (it = ports_.begin(); it != ports_.end(); ++it) {
+        if (it->second->spec().vmUUID == uuid && it->second->spec().vnicIndex == vnic) break;
+      }
+    }
     if (it != ports_.end()) {
       agent = it->second->spec().agent;
     } else {

@@ -19,6 +19,10 @@
 
 namespace {
 
+// Set from the signal handler, which may run on any thread.
+volatile sig_atomic_t gStopSignal = 0;
+void OnStopSignal(int sig) { gStopSignal = sig; }
+
 struct Config {
   std::string socketPath = "/run/sluice-host.sock";
   std::vector<std::string> agents;
@@ -130,13 +134,13 @@ int main(int argc, char** argv) {
     ports.push_back(spec);
   }
 
-  // Signals are taken synchronously by the main thread only; every thread
-  // started from here on inherits the mask.
-  sigset_t stopSignals;
-  sigemptyset(&stopSignals);
-  sigaddset(&stopSignals, SIGTERM);
-  sigaddset(&stopSignals, SIGINT);
-  pthread_sigmask(SIG_BLOCK, &stopSignals, nullptr);
+  // The host's own threads exist before main runs, so a stop signal may land
+  // on any of them: the handler only records it for the main loop.
+  struct sigaction sa {};
+  sa.sa_handler = OnStopSignal;
+  sigemptyset(&sa.sa_mask);
+  sigaction(SIGTERM, &sa, nullptr);
+  sigaction(SIGINT, &sa, nullptr);
   signal(SIGPIPE, SIG_IGN);
 
   host::Reset();
@@ -173,9 +177,9 @@ int main(int argc, char** argv) {
                    getpid());
       const auto start = std::chrono::steady_clock::now();
       for (;;) {
-        timespec tick{0, 200 * 1000 * 1000};
-        int sig = sigtimedwait(&stopSignals, nullptr, &tick);
-        if (sig == SIGTERM || sig == SIGINT) {
+        timespec tick{0, 100 * 1000 * 1000};
+        nanosleep(&tick, nullptr);
+        if (const int sig = gStopSignal; sig != 0) {
           std::fprintf(stderr, "sluice-host: %s, stopping\n", sig == SIGTERM ? "SIGTERM" : "SIGINT");
           break;
         }

@@ -26,8 +26,10 @@ void Put16(uint8_t* p, uint16_t v) {
 }
 
 // Reads exactly `len` bytes before `deadline` (none when timeoutMs is 0).
+// `started`: part of the message was read already, so an end of stream
+// here truncates it.
 bool ReadFull(int fd, uint8_t* buf, size_t len, int timeoutMs,
-              std::chrono::steady_clock::time_point deadline, std::string* error) {
+              std::chrono::steady_clock::time_point deadline, bool started, std::string* error) {
   size_t got = 0;
   while (got < len) {
     if (timeoutMs > 0) {
@@ -54,7 +56,7 @@ bool ReadFull(int fd, uint8_t* buf, size_t len, int timeoutMs,
       return false;
     }
     if (n == 0) {
-      *error = got == 0 ? "end of stream" : "truncated message";
+      *error = got == 0 && !started ? "end of stream" : "truncated message";
       return false;
     }
     got += static_cast<size_t>(n);
@@ -146,11 +148,11 @@ Message Reply(bool ok, const std::string& error) {
 bool ReadMessage(int fd, Message* out, std::string* error, int timeoutMs) {
   const auto deadline = std::chrono::steady_clock::now() + std::chrono::milliseconds(timeoutMs);
   uint8_t head[kHeaderSize];
-  if (!ReadFull(fd, head, sizeof head, timeoutMs, deadline, error)) return false;
+  if (!ReadFull(fd, head, sizeof head, timeoutMs, deadline, false, error)) return false;
   Header h;
   if (!ParseHeader(head, &h, error)) return false;
   std::vector<uint8_t> body(size_t{h.argsLen} + h.blobLen);
-  if (!ReadFull(fd, body.data(), body.size(), timeoutMs, deadline, error)) return false;
+  if (!ReadFull(fd, body.data(), body.size(), timeoutMs, deadline, true, error)) return false;
   return ParseBody(h, body, out, error);
 }
 
@@ -200,7 +202,12 @@ bool Call(const std::string& path, const Message& request, Message* reply, std::
           int timeoutMs) {
   int fd = Connect(path, error);
   if (fd < 0) return false;
-  bool ok = WriteMessage(fd, request, error) && ReadMessage(fd, reply, error, timeoutMs);
+  // A host that refuses the peer answers at once and hangs up, possibly
+  // before the request is written: its answer is still there to read.
+  std::string writeError;
+  const bool wrote = WriteMessage(fd, request, &writeError);
+  bool ok = ReadMessage(fd, reply, error, timeoutMs);
+  if (!ok && !wrote) *error = writeError;
   close(fd);
   if (ok && reply->type != Type::kReply) {
     *error = "the host answered with something other than a reply";
