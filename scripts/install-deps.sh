@@ -14,6 +14,16 @@ have_pkg libgtest-dev || need+=(libgtest-dev)
 have_pkg libgmock-dev || need+=(libgmock-dev)
 have_pkg libbenchmark-dev || need+=(libbenchmark-dev)
 have_cmd valgrind || need+=(valgrind)
+# sluice-host and sluice-ctl, and their namespace tests and demo.
+have_pkg libcli11-dev || need+=(libcli11-dev)
+have_pkg nlohmann-json3-dev || need+=(nlohmann-json3-dev)
+have_pkg libfmt-dev || need+=(libfmt-dev)
+have_cmd ip || need+=(iproute2)
+have_cmd ping || need+=(iputils-ping)
+have_cmd ethtool || need+=(ethtool)
+have_cmd socat || need+=(socat)
+have_cmd tcpdump || need+=(tcpdump)
+have_cmd python3 || need+=(python3)
 
 if [ ${#need[@]} -eq 0 ]; then
   exit 0
