@@ -34,7 +34,7 @@ Bytes Header(uint32_t magic, uint16_t version, uint16_t type, uint32_t argsLen, 
   return b;
 }
 
-TEST(ProtocolFraming, RoundTripsArgumentsAndBlob) {
+TEST(ServiceProtocol, RoundTripsArgumentsAndBlob) {
   Message m;
   m.type = Type::kRulesetWrite;
   m.args["filter"] = "vm1.eth0";
@@ -50,7 +50,7 @@ TEST(ProtocolFraming, RoundTripsArgumentsAndBlob) {
   EXPECT_EQ(back.blob, m.blob);
 }
 
-TEST(ProtocolFraming, RefusesHeadersOutsideTheBounds) {
+TEST(ServiceProtocol, RefusesHeadersOutsideTheBounds) {
   struct Case {
     const char* what;
     Bytes header;
@@ -70,7 +70,7 @@ TEST(ProtocolFraming, RefusesHeadersOutsideTheBounds) {
   }
 }
 
-TEST(ProtocolFraming, RefusesBodiesThatAreNotAnObject) {
+TEST(ServiceProtocol, RefusesBodiesThatAreNotAnObject) {
   for (const std::string& args : std::vector<std::string>{"[1,2]", "{\"a\":", "\"text\"", std::string("\xff\xfe", 2)}) {
     slcproto::Header h{slcproto::kVersion, 0x100, static_cast<uint32_t>(args.size()), 0};
     Message out;
@@ -88,7 +88,7 @@ TEST(ProtocolFraming, RefusesBodiesThatAreNotAnObject) {
 
 // A sluice-host with one agent and no ports, on a socket in a fresh
 // directory; killed on every path.
-class HostTest : public ::testing::Test {
+class ServiceHostTest : public ::testing::Test {
  protected:
   void SetUp() override {
     char tmpl[] = "/tmp/sluice-ctl-test.XXXXXX";
@@ -160,13 +160,13 @@ class HostTest : public ::testing::Test {
   pid_t pid_ = -1;
 };
 
-TEST_F(HostTest, SocketIsPrivateToItsOwner) {
+TEST_F(ServiceHostTest, SocketIsPrivateToItsOwner) {
   struct stat st{};
   ASSERT_EQ(stat(sock_.c_str(), &st), 0);
   EXPECT_EQ(st.st_mode & 0777, 0600u);
 }
 
-TEST_F(HostTest, MalformedRequestsGetAnErrorAndChangeNothing) {
+TEST_F(ServiceHostTest, MalformedRequestsGetAnErrorAndChangeNothing) {
   const uint64_t heap = HeapBytes();
   ASSERT_NE(heap, UINT64_MAX);
   std::mt19937 rng(9);
@@ -231,7 +231,7 @@ TEST_F(HostTest, MalformedRequestsGetAnErrorAndChangeNothing) {
   EXPECT_EQ(Stop(), 0);
 }
 
-TEST_F(HostTest, PeersOfAnotherUserAreRefused) {
+TEST_F(ServiceHostTest, PeersOfAnotherUserAreRefused) {
   if (geteuid() != 0) GTEST_SKIP() << "needs root to connect as another user";
   // Opening the file to everyone leaves the credential check as the only
   // guard.
