@@ -27,6 +27,7 @@ using slcproto::Type;
 // A client gets this long to finish a request it started; a stalled or
 // silent client cannot hold the control thread.
 constexpr int kRequestTimeoutMs = 2000;
+constexpr int kIdleMs = 5000;
 // Status replies show at most this many rules per filter unless asked.
 constexpr int64_t kDefaultMaxRules = 1000;
 constexpr int64_t kMaxRulesLimit = 100000;
@@ -147,12 +148,18 @@ void ControlServer::ServeConnection(int fd) {
                                  &error);
     return;
   }
+  // One connection is served at a time, which keeps requests (a port
+  // removed, a ruleset written) in a simple order; a client idle for
+  // kIdleMs is dropped so that it cannot hold the others off.
+  int idleMs = 0;
   while (!stop_) {
-    // Wait for the next request without a bound, then give the client a
-    // bounded time to send all of it.
     pollfd p{fd, POLLIN, 0};
     int r = poll(&p, 1, 100);
-    if (r == 0) continue;
+    if (r == 0) {
+      if ((idleMs += 100) >= kIdleMs) return;
+      continue;
+    }
+    idleMs = 0;
     if (r < 0 && errno == EINTR) continue;
     if (r < 0) return;
     Message req;

@@ -220,7 +220,8 @@ nlohmann::json Port::Stats() const {
           {"txToVm", c.tx[1].load()},       {"txToSwitch", c.tx[2].load()},
           {"turnedBack", c.turnedBack.load()}, {"slowPath", c.slowPath.load()},
           {"oversize", c.oversize.load()},  {"txErrors", c.txErrors.load()},
-          {"batches", c.batches.load()}};
+          {"batches", c.batches.load()}, {"busyNs", c.busyNs.load()},
+          {"moduleNs", c.moduleNs.load()}};
 }
 
 // Sends every packet left in `list` on `fd` and releases them.
@@ -242,13 +243,14 @@ void Port::Transmit(int fd, host::PacketList& list, uint32_t direction) {
     msgs[i].msg_hdr.msg_iovlen = 1;
   }
   size_t done = 0;
+  int waits = 0;
   while (done < msgs.size()) {
     int n = sendmmsg(fd, msgs.data() + done, static_cast<unsigned>(msgs.size() - done), 0);
     if (n < 0) {
       if (errno == EINTR) continue;
-      if (errno == ENOBUFS || errno == EAGAIN) {
-        // The interface queue is full; wait for it rather than lose an
-        // accepted frame.
+      // The interface queue is full: wait for it rather than lose an
+      // accepted frame, but not past a second or a stop.
+      if ((errno == ENOBUFS || errno == EAGAIN) && waits++ < 100 && !stop_.load()) {
         pollfd p{fd, POLLOUT, 0};
         (void)poll(&p, 1, 10);
         continue;
@@ -293,6 +295,7 @@ void Port::Reader(int side) {
     }
     int n = recvmmsg(inFd, msgs, kBatch, MSG_DONTWAIT, nullptr);
     if (n <= 0) continue;
+    const auto t0 = std::chrono::steady_clock::now();
     counters_.rx[side] += static_cast<uint64_t>(n);
     counters_.batches++;
     host::PacketList list;
@@ -305,7 +308,11 @@ void Port::Reader(int side) {
           std::span<const uint8_t>(storage.data() + size_t(i) * kFrameMax, msgs[i].msg_len)));
     }
     if (list.Count() == 0) continue;
+    const auto t1 = std::chrono::steady_clock::now();
     (void)host::Sluice::Deliver(filter_, list, direction);
+    const auto t2 = std::chrono::steady_clock::now();
+    counters_.moduleNs += static_cast<uint64_t>(
+        std::chrono::duration_cast<std::chrono::nanoseconds>(t2 - t1).count());
     Transmit(outFd, list, direction);
     if (host::Sluice::IssuedCount(filter_) > 0) {
       TransmitDeliveries(fd_[1], host::Sluice::TakeIssued(filter_), 2);
@@ -316,6 +323,9 @@ void Port::Reader(int side) {
         for (ZelPkt* pkt : d.packets) zel_PktRelease(pkt);
       }
     }
+    counters_.busyNs += static_cast<uint64_t>(std::chrono::duration_cast<std::chrono::nanoseconds>(
+                                                  std::chrono::steady_clock::now() - t0)
+                                                  .count());
   }
 }
 

@@ -46,6 +46,10 @@ struct PortCounters {
   std::atomic<uint64_t> oversize{0};
   std::atomic<uint64_t> txErrors{0};
   std::atomic<uint64_t> batches{0};
+  // Time spent handling batches (from receive to transmit) and, of that,
+  // inside the filter's packet callback.
+  std::atomic<uint64_t> busyNs{0};
+  std::atomic<uint64_t> moduleNs{0};
 };
 
 class Port {
