@@ -231,6 +231,21 @@ TEST_F(ServiceHostTest, MalformedRequestsGetAnErrorAndChangeNothing) {
   EXPECT_EQ(Stop(), 0);
 }
 
+TEST_F(ServiceHostTest, AgentsAreCreatedThroughTheCreateAgentProperty) {
+  Message reply;
+  ASSERT_TRUE(Request(Type::kCreateAgent, &reply, {{"text", "second:default-action=ACTION_DROP"}}));
+  EXPECT_TRUE(reply.args.value("ok", false)) << reply.args.dump();
+  ASSERT_TRUE(Request(Type::kCreateAgent, &reply, {{"text", "second"}}));
+  EXPECT_FALSE(reply.args.value("ok", true)) << "a second agent of the same name";
+
+  ASSERT_TRUE(Request(Type::kStatus, &reply, {{"agent", "second"}}));
+  ASSERT_TRUE(reply.args.value("ok", false)) << reply.args.dump();
+  ASSERT_EQ(reply.args["agents"].size(), 1u);
+  EXPECT_EQ(reply.args["agents"][0]["name"], "second");
+  EXPECT_TRUE(reply.args["agents"][0]["filters"].empty());
+  EXPECT_EQ(Stop(), 0);
+}
+
 TEST_F(ServiceHostTest, PeersOfAnotherUserAreRefused) {
   if (geteuid() != 0) GTEST_SKIP() << "needs root to connect as another user";
   // Opening the file to everyone leaves the credential check as the only
