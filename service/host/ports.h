@@ -5,14 +5,16 @@
 // lists the filter turns back go out on the switch side, and lists for the
 // slow path are counted and released (no slow path is attached here).
 //
-// Interfaces are read and written through AF_PACKET sockets in promiscuous
-// mode. Senders must not leave checksums or segmentation to offload: a
-// frame larger than the buffer is counted as oversize and dropped.
+// Interfaces are read through TPACKET_V3 receive rings on AF_PACKET sockets
+// in promiscuous mode (or recvmmsg where a ring cannot be set up) and
+// written with sendmmsg. Senders must not leave checksums or segmentation to
+// offload: a frame longer than kFrameMax is counted as oversize and dropped.
 #pragma once
 
 #include <atomic>
 #include <cstdint>
 #include <memory>
+#include <span>
 #include <string>
 #include <thread>
 
@@ -55,6 +57,9 @@ struct PortCounters {
 class Port {
  public:
   static constexpr unsigned kBatch = 64;
+  // An MTU-sized frame with a VLAN tag and room to spare; anything longer
+  // came from segmentation offload.
+  static constexpr uint32_t kFrameMax = 9216 + 18;
 
   // Opens both interfaces, creates the filter through the framework and
   // starts one reader per side. Null with a reason on failure (nothing left
@@ -71,13 +76,28 @@ class Port {
 
  private:
   Port() = default;
+  struct RxFrame {
+    const uint8_t* data;
+    uint32_t len;          // bytes at data
+    uint32_t wireLen;      // length on the wire
+  };
+  struct Ring {
+    uint8_t* map = nullptr;
+    size_t mapLen = 0;
+    uint32_t blockSize = 0;
+    uint32_t blocks = 0;
+  };
   void Reader(int side);
+  void RingReader(int side);
+  // Hands `frames` read on `side` to the filter and sends what it leaves.
+  void Process(int side, std::span<const RxFrame> frames);
   void Transmit(int fd, host::PacketList& list, uint32_t direction);
   void TransmitDeliveries(int fd, std::vector<host::Delivery> deliveries, uint32_t direction);
 
   PortSpec spec_;
   host::FilterId filter_ = 0;
   int fd_[3] = {-1, -1, -1};       // [1] switch side, [2] VM side
+  Ring ring_[3];
   std::atomic<bool> stop_{false};
   std::thread readers_[3];
   PortCounters counters_;
