@@ -262,7 +262,7 @@ nlohmann::json Port::Stats() const {
           {"turnedBack", c.turnedBack.load()}, {"slowPath", c.slowPath.load()},
           {"oversize", c.oversize.load()},  {"txErrors", c.txErrors.load()},
           {"batches", c.batches.load()}, {"busyNs", c.busyNs.load()},
-          {"moduleNs", c.moduleNs.load()},
+          {"moduleNs", c.moduleNs.load()}, {"txNs", c.txNs.load()},
           {"rxRings", ring_[1].map != nullptr && ring_[2].map != nullptr}};
 }
 
@@ -338,6 +338,9 @@ void Port::Process(int side, std::span<const RxFrame> frames) {
   counters_.moduleNs += static_cast<uint64_t>(
       std::chrono::duration_cast<std::chrono::nanoseconds>(t2 - t1).count());
   Transmit(fd_[side == 1 ? 2 : 1], list, direction);
+  counters_.txNs += static_cast<uint64_t>(
+      std::chrono::duration_cast<std::chrono::nanoseconds>(std::chrono::steady_clock::now() - t2)
+          .count());
   if (host::Sluice::IssuedCount(filter_) > 0) {
     TransmitDeliveries(fd_[1], host::Sluice::TakeIssued(filter_), 2);
   }

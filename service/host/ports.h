@@ -52,6 +52,7 @@ struct PortCounters {
   // inside the filter's packet callback.
   std::atomic<uint64_t> busyNs{0};
   std::atomic<uint64_t> moduleNs{0};
+  std::atomic<uint64_t> txNs{0};        // of that, in sending what passed
 };
 
 class Port {
