@@ -146,6 +146,28 @@ check "device set by uuid and vnic" ctl dev set --uuid 564d-live --vnic 3 "$DIR/
 check "device get by name shows it" bash -c "'$CTL_BIN' --socket '$SOCK' dev get --filter vm1.eth0 | grep -q 'dport=5600'"
 check "device test ioctl" ctl dev test --filter vm1.eth0
 
+# --- hostile rulesets on a live filter: refused, host up, heap unchanged -------
+HEAP1=$(ctl --json stats | python3 -c 'import json,sys; print(json.load(sys.stdin)["heapBytes"])')
+ctl ruleset get vm1.eth0 --wire "$DIR/good.bin"
+python3 - "$DIR" <<'PY'
+import struct, sys
+d = sys.argv[1]
+good = open(d + "/good.bin", "rb").read()
+# header claims far more rules than follow; a header cut short; random bytes
+open(d + "/many.bin", "wb").write(good[:3] + struct.pack("<I", 0xFFFFFFFF) + good[7:])
+open(d + "/short.bin", "wb").write(good[:9])
+import random
+random.seed(9)
+open(d + "/noise.bin", "wb").write(bytes(random.randrange(256) for _ in range(700)))
+PY
+for f in many short noise; do
+  check "property refuses a $f ruleset" bash -c "! '$CTL_BIN' --socket '$SOCK' ruleset set vm1.eth0 --wire '$DIR/$f.bin' 2>/dev/null"
+  check "device refuses a $f ruleset" bash -c "! '$CTL_BIN' --socket '$SOCK' dev set --filter vm1.eth0 --wire '$DIR/$f.bin' 2>/dev/null"
+done
+check "the rules in force survive hostile rulesets" bash -c "'$CTL_BIN' --socket '$SOCK' ruleset get vm1.eth0 | grep -q 'dport=5600'"
+HEAP2=$(ctl --json stats | python3 -c 'import json,sys; print(json.load(sys.stdin)["heapBytes"])')
+check "heap unchanged by hostile rulesets ($HEAP1 -> $HEAP2)" test "$HEAP1" = "$HEAP2"
+
 # --- ports come and go while the host runs --------------------------------------
 check "remove the port" ctl remove-port vm1.eth0
 check "ping fails with no port" bash -c "! ip netns exec $P-vm ping -c 1 -W 1 -q 10.77.0.2"
