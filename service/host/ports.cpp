@@ -124,15 +124,23 @@ bool ParsePortSpec(const std::string& text, PortSpec* out, std::string* error) {
     }
     const std::string k = item.substr(0, eq), v = item.substr(eq + 1);
     bool ok = true;
-    if (k == "name") s.name = v;
-    else if (k == "agent") s.agent = v;
-    else if (k == "vm") s.vmIf = v;
-    else if (k == "switch") s.switchIf = v;
-    else if (k == "uuid") s.vmUUID = v;
-    else if (k == "vnic") ok = ParseU32(v, &s.vnicIndex);
-    else if (k == "endpoint") ok = ParseU32(v, &s.endPointType);
-    else if (k == "failure") ok = ParseU32(v, &s.failurePolicy);
-    else {
+    if (k == "name") {
+      s.name = v;
+    } else if (k == "agent") {
+      s.agent = v;
+    } else if (k == "vm") {
+      s.vmIf = v;
+    } else if (k == "switch") {
+      s.switchIf = v;
+    } else if (k == "uuid") {
+      s.vmUUID = v;
+    } else if (k == "vnic") {
+      ok = ParseU32(v, &s.vnicIndex);
+    } else if (k == "endpoint") {
+      ok = ParseU32(v, &s.endPointType);
+    } else if (k == "failure") {
+      ok = ParseU32(v, &s.failurePolicy);
+    } else {
       *error = "unknown port field: " + k;
       return false;
     }
@@ -147,9 +155,14 @@ bool ParsePortSpec(const std::string& text, PortSpec* out, std::string* error) {
 }
 
 nlohmann::json PortSpecToJson(const PortSpec& s) {
-  return {{"name", s.name},         {"agent", s.agent},       {"vm", s.vmIf},
-          {"switch", s.switchIf},   {"uuid", s.vmUUID},       {"vnic", s.vnicIndex},
-          {"endpoint", s.endPointType}, {"failure", s.failurePolicy}};
+  return {{"name", s.name},
+          {"agent", s.agent},
+          {"vm", s.vmIf},
+          {"switch", s.switchIf},
+          {"uuid", s.vmUUID},
+          {"vnic", s.vnicIndex},
+          {"endpoint", s.endPointType},
+          {"failure", s.failurePolicy}};
 }
 
 bool PortSpecFromJson(const nlohmann::json& j, PortSpec* out, std::string* error) {
@@ -257,12 +270,18 @@ Port::~Port() {
 
 nlohmann::json Port::Stats() const {
   auto& c = counters_;
-  return {{"rxFromSwitch", c.rx[1].load()}, {"rxFromVm", c.rx[2].load()},
-          {"txToVm", c.tx[1].load()},       {"txToSwitch", c.tx[2].load()},
-          {"turnedBack", c.turnedBack.load()}, {"slowPath", c.slowPath.load()},
-          {"oversize", c.oversize.load()},  {"txErrors", c.txErrors.load()},
-          {"batches", c.batches.load()}, {"busyNs", c.busyNs.load()},
-          {"moduleNs", c.moduleNs.load()}, {"txNs", c.txNs.load()},
+  return {{"rxFromSwitch", c.rx[1].load()},
+          {"rxFromVm", c.rx[2].load()},
+          {"txToVm", c.tx[1].load()},
+          {"txToSwitch", c.tx[2].load()},
+          {"turnedBack", c.turnedBack.load()},
+          {"slowPath", c.slowPath.load()},
+          {"oversize", c.oversize.load()},
+          {"txErrors", c.txErrors.load()},
+          {"batches", c.batches.load()},
+          {"busyNs", c.busyNs.load()},
+          {"moduleNs", c.moduleNs.load()},
+          {"txNs", c.txNs.load()},
           {"rxRings", ring_[1].map != nullptr && ring_[2].map != nullptr}};
 }
 
@@ -308,8 +327,7 @@ void Port::Transmit(int fd, host::PacketList& list, uint32_t direction) {
   }
 }
 
-void Port::TransmitDeliveries(int fd, std::vector<host::Delivery> deliveries,
-                              uint32_t direction) {
+void Port::TransmitDeliveries(int fd, std::vector<host::Delivery> deliveries, uint32_t direction) {
   for (auto& d : deliveries) {
     counters_.turnedBack += d.packets.size();
     host::PacketList list;
@@ -335,8 +353,8 @@ void Port::Process(int side, std::span<const RxFrame> frames) {
   const auto t1 = std::chrono::steady_clock::now();
   (void)host::Sluice::Deliver(filter_, list, direction);
   const auto t2 = std::chrono::steady_clock::now();
-  counters_.moduleNs += static_cast<uint64_t>(
-      std::chrono::duration_cast<std::chrono::nanoseconds>(t2 - t1).count());
+  counters_.moduleNs +=
+      static_cast<uint64_t>(std::chrono::duration_cast<std::chrono::nanoseconds>(t2 - t1).count());
   Transmit(fd_[side == 1 ? 2 : 1], list, direction);
   counters_.txNs += static_cast<uint64_t>(
       std::chrono::duration_cast<std::chrono::nanoseconds>(std::chrono::steady_clock::now() - t2)
@@ -388,7 +406,8 @@ void Port::RingReader(int side) {
   uint32_t current = 0;
   RxFrame frames[kBatch];
   while (!stop_.load(std::memory_order_relaxed)) {
-    auto* block = reinterpret_cast<tpacket_block_desc*>(ring.map + size_t{current} * ring.blockSize);
+    auto* block =
+        reinterpret_cast<tpacket_block_desc*>(ring.map + size_t{current} * ring.blockSize);
     if ((__atomic_load_n(&block->hdr.bh1.block_status, __ATOMIC_ACQUIRE) & TP_STATUS_USER) == 0) {
       pollfd p{fd_[side], POLLIN | POLLERR, 0};
       (void)poll(&p, 1, 50);
@@ -396,7 +415,8 @@ void Port::RingReader(int side) {
     }
     const uint32_t count = block->hdr.bh1.num_pkts;
     const uint8_t* const blockEnd = ring.map + size_t{current + 1} * ring.blockSize;
-    const uint8_t* at = reinterpret_cast<const uint8_t*>(block) + block->hdr.bh1.offset_to_first_pkt;
+    const uint8_t* at =
+        reinterpret_cast<const uint8_t*>(block) + block->hdr.bh1.offset_to_first_pkt;
     size_t n = 0;
     for (uint32_t i = 0; i < count && at + sizeof(tpacket3_hdr) <= blockEnd; i++) {
       const auto* h = reinterpret_cast<const tpacket3_hdr*>(at);

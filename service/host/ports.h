@@ -14,21 +14,20 @@
 #include <atomic>
 #include <cstdint>
 #include <memory>
+#include <nlohmann/json.hpp>
 #include <span>
 #include <string>
 #include <thread>
-
-#include <nlohmann/json.hpp>
 
 #include "host/sluice/framework.h"
 
 namespace service {
 
 struct PortSpec {
-  std::string name;          // the filter's name
+  std::string name;  // the filter's name
   std::string agent;
-  std::string vmIf;          // VM-side interface
-  std::string switchIf;      // switch-side interface
+  std::string vmIf;      // VM-side interface
+  std::string switchIf;  // switch-side interface
   std::string vmUUID;
   uint32_t vnicIndex = 0;
   uint32_t endPointType = 0;
@@ -41,10 +40,10 @@ nlohmann::json PortSpecToJson(const PortSpec& spec);
 bool PortSpecFromJson(const nlohmann::json& j, PortSpec* out, std::string* error);
 
 struct PortCounters {
-  std::atomic<uint64_t> rx[3]{};          // by direction (1, 2)
-  std::atomic<uint64_t> tx[3]{};          // by direction of travel
-  std::atomic<uint64_t> turnedBack{0};    // issued toward the switch
-  std::atomic<uint64_t> slowPath{0};      // faulted, released
+  std::atomic<uint64_t> rx[3]{};        // by direction (1, 2)
+  std::atomic<uint64_t> tx[3]{};        // by direction of travel
+  std::atomic<uint64_t> turnedBack{0};  // issued toward the switch
+  std::atomic<uint64_t> slowPath{0};    // faulted, released
   std::atomic<uint64_t> oversize{0};
   std::atomic<uint64_t> txErrors{0};
   std::atomic<uint64_t> batches{0};
@@ -52,7 +51,7 @@ struct PortCounters {
   // inside the filter's packet callback.
   std::atomic<uint64_t> busyNs{0};
   std::atomic<uint64_t> moduleNs{0};
-  std::atomic<uint64_t> txNs{0};        // of that, in sending what passed
+  std::atomic<uint64_t> txNs{0};  // of that, in sending what passed
 };
 
 class Port {
@@ -79,8 +78,8 @@ class Port {
   Port() = default;
   struct RxFrame {
     const uint8_t* data;
-    uint32_t len;          // bytes at data
-    uint32_t wireLen;      // length on the wire
+    uint32_t len;      // bytes at data
+    uint32_t wireLen;  // length on the wire
   };
   struct Ring {
     uint8_t* map = nullptr;
@@ -97,7 +96,7 @@ class Port {
 
   PortSpec spec_;
   host::FilterId filter_ = 0;
-  int fd_[3] = {-1, -1, -1};       // [1] switch side, [2] VM side
+  int fd_[3] = {-1, -1, -1};  // [1] switch side, [2] VM side
   Ring ring_[3];
   std::atomic<bool> stop_{false};
   std::thread readers_[3];

@@ -2,6 +2,7 @@
 // facing hostile clients: every malformed request gets an error reply, the
 // host keeps serving and the module heap is what it was.
 #include <fcntl.h>
+#include <gtest/gtest.h>
 #include <signal.h>
 #include <sys/socket.h>
 #include <sys/stat.h>
@@ -13,8 +14,6 @@
 #include <random>
 #include <string>
 #include <thread>
-
-#include <gtest/gtest.h>
 
 #include "service/protocol/protocol.h"
 
@@ -71,13 +70,13 @@ TEST(ServiceProtocol, RefusesHeadersOutsideTheBounds) {
 }
 
 TEST(ServiceProtocol, RefusesBodiesThatAreNotAnObject) {
-  for (const std::string& args : std::vector<std::string>{"[1,2]", "{\"a\":", "\"text\"", std::string("\xff\xfe", 2)}) {
+  for (const std::string& args :
+       std::vector<std::string>{"[1,2]", "{\"a\":", "\"text\"", std::string("\xff\xfe", 2)}) {
     slcproto::Header h{slcproto::kVersion, 0x100, static_cast<uint32_t>(args.size()), 0};
     Message out;
     std::string error;
-    EXPECT_FALSE(slcproto::ParseBody(h, std::span(reinterpret_cast<const uint8_t*>(args.data()),
-                                                  args.size()),
-                                     &out, &error))
+    EXPECT_FALSE(slcproto::ParseBody(
+        h, std::span(reinterpret_cast<const uint8_t*>(args.data()), args.size()), &out, &error))
         << args;
   }
   slcproto::Header h{slcproto::kVersion, 0x100, 2, 3};
@@ -100,9 +99,8 @@ class ServiceHostTest : public ::testing::Test {
     if (pid_ == 0) {
       int devnull = open("/dev/null", O_WRONLY);
       dup2(devnull, 2);
-      execl(SLUICE_HOST_BIN, "sluice-host", "--socket", sock_.c_str(), "--gre", "memory",
-            "--agent", "fw:default-action=ACTION_ACCEPT", "--max-seconds", "60",
-            static_cast<char*>(nullptr));
+      execl(SLUICE_HOST_BIN, "sluice-host", "--socket", sock_.c_str(), "--gre", "memory", "--agent",
+            "fw:default-action=ACTION_ACCEPT", "--max-seconds", "60", static_cast<char*>(nullptr));
       _exit(127);
     }
     for (int i = 0; i < 100; i++) {
@@ -161,7 +159,7 @@ class ServiceHostTest : public ::testing::Test {
 };
 
 TEST_F(ServiceHostTest, SocketIsPrivateToItsOwner) {
-  struct stat st{};
+  struct stat st {};
   ASSERT_EQ(stat(sock_.c_str(), &st), 0);
   EXPECT_EQ(st.st_mode & 0777, 0600u);
 }
@@ -209,8 +207,9 @@ TEST_F(ServiceHostTest, MalformedRequestsGetAnErrorAndChangeNothing) {
       {Type::kRulesetRead, {}, {}},
       {Type::kCreateAgent, {{"text", std::string(5000, 'a')}}, {}},
       {Type::kCreateAgent, {{"text", nlohmann::json::array()}}, {}},
-      {Type::kAddPort, {{"port", {{"name", "p"}, {"agent", "fw"}, {"vm", "nope0"},
-                                  {"switch", "nope1"}}}}, {}},
+      {Type::kAddPort,
+       {{"port", {{"name", "p"}, {"agent", "fw"}, {"vm", "nope0"}, {"switch", "nope1"}}}},
+       {}},
       {Type::kAddPort, {{"port", {{"name", "p"}, {"vnic", -1}}}}, {}},
       {Type::kRemovePort, {{"name", "p"}}, {}},
       {Type::kDevSetRuleset, {{"uuid", "u"}, {"vnic", 1}, {"agent", "fw"}}, Bytes(3, 0)},
