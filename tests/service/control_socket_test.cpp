@@ -11,6 +11,7 @@
 
 #include <chrono>
 #include <cstring>
+#include <fstream>
 #include <random>
 #include <string>
 #include <thread>
@@ -270,6 +271,61 @@ TEST_F(ServiceHostTest, PeersOfAnotherUserAreRefused) {
   EXPECT_EQ(WEXITSTATUS(status), 0) << "10: setuid, 11: no reply, 12: accepted";
   Message hello;
   EXPECT_TRUE(Request(Type::kHello, &hello));
+}
+
+// Settings from a file: the host takes its socket and agents from it, and
+// refuses a file with an unknown setting before loading anything.
+TEST(ServiceHostConfig, ReadsSettingsFromAFileAndRefusesUnknownOnes) {
+  char tmpl[] = "/tmp/sluice-cfg-test.XXXXXX";
+  ASSERT_NE(mkdtemp(tmpl), nullptr);
+  const std::string dir = tmpl, sock = dir + "/c.sock", good = dir + "/good.conf",
+                    bad = dir + "/bad.conf";
+  std::ofstream(good) << "# a host from a file\n"
+                      << "socket " << sock << "\n"
+                      << "agent cfg:default-action=ACTION_DROP   # trailing comment\n"
+                      << "gre memory\n";
+  std::ofstream(bad) << "agent x\nbogus 1\n";
+  auto spawn = [](const std::string& config) {
+    pid_t pid = fork();
+    if (pid == 0) {
+      int devnull = open("/dev/null", O_WRONLY);
+      dup2(devnull, 2);
+      execl(SLUICE_HOST_BIN, "sluice-host", "--config", config.c_str(), "--max-seconds", "30",
+            static_cast<char*>(nullptr));
+      _exit(127);
+    }
+    return pid;
+  };
+  auto exitStatus = [](pid_t pid) {
+    int status = 0;
+    waitpid(pid, &status, 0);
+    return WIFEXITED(status) ? WEXITSTATUS(status) : 128 + WTERMSIG(status);
+  };
+
+  EXPECT_EQ(exitStatus(spawn(bad)), 2);
+
+  pid_t pid = spawn(good);
+  ASSERT_GT(pid, 0);
+  Message status;
+  bool up = false;
+  for (int i = 0; i < 100 && !up; i++) {
+    Message req;
+    req.type = Type::kStatus;
+    req.args["agent"] = "cfg";
+    std::string error;
+    up = slcproto::Call(sock, req, &status, &error, 5000);
+    if (!up) std::this_thread::sleep_for(std::chrono::milliseconds(50));
+  }
+  EXPECT_TRUE(up);
+  if (up) {
+    ASSERT_EQ(status.args["agents"].size(), 1u);
+    EXPECT_EQ(status.args["agents"][0]["name"], "cfg");
+  }
+  kill(pid, SIGTERM);
+  EXPECT_EQ(exitStatus(pid), 0);
+  unlink(good.c_str());
+  unlink(bad.c_str());
+  rmdir(dir.c_str());
 }
 
 }  // namespace
