@@ -55,10 +55,13 @@ send_udp() {  # send_udp FROM_NS TO_ADDR PORT COUNT [PAYLOAD_BYTES]
 }
 # Receives UDP datagrams on PORT in namespace NS for SECONDS into FILE.
 recv_udp() {  # recv_udp NS PORT SECONDS FILE
-  in_ns "$1" timeout "$3" socat -u "UDP-RECV:$2" - >"$4" 2>/dev/null &
+  # Started through ip directly (not a function) so that $! is the
+  # receiver and killing it ends it.
+  ip netns exec "$P-$1" timeout "$3" socat -u "UDP-RECV:$2" - >"$4" 2>/dev/null &
   LAST_RECV=$!
 }
 rule_packets() {  # rule_packets INDEX: packet counter of rule INDEX
+  sleep 0.3  # the last frames may still sit in a receive ring block
   ctl --json status --agent fw | python3 -c '
 import json, sys
 t = json.load(sys.stdin)
@@ -89,9 +92,9 @@ send_udp vm 10.77.0.2 5000 5; send_udp vm 10.77.0.2 6000 5; wait $R1 $R2
 check "udp to an open port arrives" test "$(wc -l <"$DIR/u5000")" -eq 5
 check "udp to a dropped port does not" test "$(wc -l <"$DIR/u6000")" -eq 0
 
-in_ns net timeout 5 socat -u TCP-LISTEN:7000,reuseaddr - >"$DIR/t7000" 2>/dev/null &
+ip netns exec "$P-net" timeout 5 socat -u TCP-LISTEN:7000,reuseaddr - >"$DIR/t7000" 2>/dev/null &
 T1=$!
-in_ns net timeout 5 socat -u TCP-LISTEN:7001,reuseaddr - >"$DIR/t7001" 2>/dev/null &
+ip netns exec "$P-net" timeout 5 socat -u TCP-LISTEN:7001,reuseaddr - >"$DIR/t7001" 2>/dev/null &
 T2=$!
 sleep 0.3
 echo "hello over tcp" | in_ns vm timeout 3 socat -u - TCP:10.77.0.2:7000,connect-timeout=2 2>/dev/null
@@ -107,7 +110,7 @@ check "accept counter equals datagrams sent" test "$(rule_packets 0)" = 12
 check "drop counter equals datagrams sent" test "$(rule_packets 1)" = 7
 
 # --- rules changed while traffic flows lose no accepted packet ----------------
-recv_udp net 5200 12 "$DIR/u5200"; sleep 0.3
+recv_udp net 5200 30 "$DIR/u5200"; sleep 0.3
 ( send_udp vm 10.77.0.2 5200 150 ) &
 SENDER=$!
 for i in $(seq 15); do
@@ -121,15 +124,20 @@ check "no accepted datagram lost across 30 rule changes" test "$(wc -l <"$DIR/u5
 set_rules "action=gre gre=10.78.0.2 snaplen=64 ipv4 proto=udp dport=5300" \
   "action=dscp dscp=46 ipv4 proto=udp dport=5400" \
   "action=l2rewrite rewrite=02:00:00:00:77:99 ipv4 proto=udp dport=5500"
-in_ns gre timeout 4 tcpdump -i g1 -U -w "$DIR/gre.pcap" proto gre 2>/dev/null &
+ip netns exec "$P-gre" timeout 10 tcpdump -i g1 -U -w "$DIR/gre.pcap" proto gre 2>"$DIR/c1.err" &
 C1=$!
-in_ns net timeout 4 tcpdump -i eth0 -U -w "$DIR/net.pcap" udp 2>/dev/null &
+ip netns exec "$P-net" timeout 10 tcpdump -i eth0 -U -w "$DIR/net.pcap" udp 2>"$DIR/c2.err" &
 C2=$!
-sleep 1
+# Capturing starts when tcpdump says it is listening.
+for _ in $(seq 50); do
+  grep -q listening "$DIR/c1.err" && grep -q listening "$DIR/c2.err" && break
+  sleep 0.1
+done
 send_udp vm 10.77.0.2 5300 4 300
 send_udp vm 10.77.0.2 5400 3
 send_udp net 10.77.0.1 5500 3
-wait $C1 $C2
+sleep 0.5
+kill -INT $C1 $C2 2>/dev/null; wait $C1 $C2 2>/dev/null
 GRE_COUNT=$(tcpdump -r "$DIR/gre.pcap" -nn 2>/dev/null | wc -l)
 check "4 GRE copies captured" test "$GRE_COUNT" -eq 4
 # Outer IPv4 (20) + GRE (4) + the mirrored frame cut at 64 bytes.
