@@ -33,7 +33,7 @@ cleanup() {
     kill -KILL "$HOST_PID" 2>/dev/null
   fi
   topo_down "$P"
-  rm -rf "$DIR"
+  [ -n "${KEEP_DIR:-}" ] || rm -rf "$DIR"
 }
 trap cleanup EXIT
 trap 'exit 1' INT TERM
@@ -124,9 +124,9 @@ check "no accepted datagram lost across 30 rule changes" test "$(wc -l <"$DIR/u5
 set_rules "action=gre gre=10.78.0.2 snaplen=64 ipv4 proto=udp dport=5300" \
   "action=dscp dscp=46 ipv4 proto=udp dport=5400" \
   "action=l2rewrite rewrite=02:00:00:00:77:99 ipv4 proto=udp dport=5500"
-ip netns exec "$P-gre" timeout 10 tcpdump -i g1 -U -w "$DIR/gre.pcap" proto gre 2>"$DIR/c1.err" &
+ip netns exec "$P-gre" timeout 10 tcpdump --immediate-mode -i g1 -U -w "$DIR/gre.pcap" proto gre 2>"$DIR/c1.err" &
 C1=$!
-ip netns exec "$P-net" timeout 10 tcpdump -i eth0 -U -w "$DIR/net.pcap" udp 2>"$DIR/c2.err" &
+ip netns exec "$P-net" timeout 10 tcpdump --immediate-mode -i eth0 -U -w "$DIR/net.pcap" udp 2>"$DIR/c2.err" &
 C2=$!
 # Capturing starts when tcpdump says it is listening.
 for _ in $(seq 50); do
@@ -136,7 +136,7 @@ done
 send_udp vm 10.77.0.2 5300 4 300
 send_udp vm 10.77.0.2 5400 3
 send_udp net 10.77.0.1 5500 3
-sleep 0.5
+sleep 1  # frames still in the filter's receive ring, copies still in flight
 kill -INT $C1 $C2 2>/dev/null; wait $C1 $C2 2>/dev/null
 GRE_COUNT=$(tcpdump -r "$DIR/gre.pcap" -nn 2>/dev/null | wc -l)
 check "4 GRE copies captured" test "$GRE_COUNT" -eq 4
