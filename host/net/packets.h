@@ -89,6 +89,11 @@ class ResPools {
 
 // Raw sockets created by the module. Only IPv4 raw GRE sockets (2, 3, 47)
 // can be created; using or closing a socket that is not open aborts.
+//
+// Two backends: Memory (after Reset) records each datagram and sends
+// nothing; Kernel opens a real raw IPPROTO_GRE socket per module socket and
+// sends through the kernel's routing, recording only counts. The backend in
+// force when the module creates a socket serves it until it is closed.
 struct SentDatagram {
   uint64_t socket;
   uint8_t family;            // from the socket address
@@ -105,8 +110,17 @@ struct SocketInfo {
   bool open = false;
 };
 
+enum class SocketBackend { Memory, Kernel };
+
 class Sockets {
  public:
+  static void SetBackend(SocketBackend backend);
+  static SocketBackend Backend();
+  // Datagrams handed over since Reset (either backend), and kernel sends
+  // that failed.
+  static uint64_t SentCount();
+  static uint64_t SendErrors();
+  // Memory backend: the datagrams recorded.
   static std::vector<SentDatagram> Sent();
   static void ClearSent();
   // Sockets open now.

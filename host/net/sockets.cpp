@@ -1,5 +1,12 @@
 // Resource pools of the virtual switch and the raw sockets the module opens
-// for GRE copies. Both only record: nothing leaves the process.
+// for GRE copies. Pools only record; sockets either record (Memory backend)
+// or send through a real raw socket (Kernel backend).
+#include <fcntl.h>
+#include <netinet/in.h>
+#include <sys/socket.h>
+#include <unistd.h>
+
+#include <cerrno>
 #include <cstring>
 #include <map>
 #include <mutex>
@@ -52,6 +59,7 @@ void PoolLeftovers(std::vector<std::string>* out) {
 struct SocketRecord {
   SocketInfo info;
   std::vector<std::array<int32_t, 3>> options;
+  int fd = -1;                 // Kernel backend: the real socket
 };
 
 struct SocketState {
@@ -60,6 +68,9 @@ struct SocketState {
   std::vector<SentDatagram> sent;
   uint64_t nextHandle = 1;
   uint64_t open = 0;
+  uint64_t sentCount = 0;
+  uint64_t sendErrors = 0;
+  SocketBackend backend = SocketBackend::Memory;
 };
 
 SocketState& Socks() {
@@ -78,9 +89,15 @@ SocketRecord& OpenSocket(SocketState& st, uint64_t s, const char* call) {
 void ResetSockets() {
   SocketState& st = Socks();
   std::lock_guard<std::mutex> g(st.mu);
+  for (auto& [handle, rec] : st.sockets) {
+    if (rec.fd >= 0) close(rec.fd);
+  }
   st.sockets.clear();
   st.sent.clear();
   st.open = 0;
+  st.sentCount = 0;
+  st.sendErrors = 0;
+  st.backend = SocketBackend::Memory;
   // Handles keep counting up so that a handle from before a reset stays
   // unknown.
 }
@@ -118,6 +135,30 @@ int64_t ResPools::OutstandingTotal() {
   int64_t total = 0;
   for (const auto& [tag, n] : st.outstanding) total += n;
   return total;
+}
+
+void Sockets::SetBackend(SocketBackend backend) {
+  SocketState& st = Socks();
+  std::lock_guard<std::mutex> g(st.mu);
+  st.backend = backend;
+}
+
+SocketBackend Sockets::Backend() {
+  SocketState& st = Socks();
+  std::lock_guard<std::mutex> g(st.mu);
+  return st.backend;
+}
+
+uint64_t Sockets::SentCount() {
+  SocketState& st = Socks();
+  std::lock_guard<std::mutex> g(st.mu);
+  return st.sentCount;
+}
+
+uint64_t Sockets::SendErrors() {
+  SocketState& st = Socks();
+  std::lock_guard<std::mutex> g(st.mu);
+  return st.sendErrors;
 }
 
 std::vector<SentDatagram> Sockets::Sent() {
@@ -195,8 +236,14 @@ ZelStatus zel_SocketCreate(int32_t family, int32_t type, int32_t protocol, ZelSo
   }
   host::SocketState& st = host::Socks();
   std::lock_guard<std::mutex> g(st.mu);
+  int fd = -1;
+  if (st.backend == host::SocketBackend::Kernel) {
+    fd = socket(AF_INET, SOCK_RAW | SOCK_CLOEXEC, IPPROTO_GRE);
+    if (fd < 0) return ZEL_FAILURE;
+  }
   uint64_t handle = st.nextHandle++;
-  st.sockets[handle] = host::SocketRecord{host::SocketInfo{family, type, protocol, true}, {}};
+  st.sockets[handle] =
+      host::SocketRecord{host::SocketInfo{family, type, protocol, true}, {}, fd};
   st.open++;
   *sock = handle;
   return ZEL_OK;
@@ -211,6 +258,15 @@ ZelStatus zel_SocketSetSockOpt(ZelSocket sock, int32_t level, int32_t option, co
   if (value == nullptr || len != sizeof(int32_t)) return ZEL_BAD_PARAM;
   int32_t v;
   std::memcpy(&v, value, sizeof v);
+  if (rec.fd >= 0) {
+    // Only the non-blocking option has a meaning here; others are recorded.
+    if (level == ZEL_SOL_SOCKET && option == ZEL_SO_NONBLOCKING) {
+      int flags = fcntl(rec.fd, F_GETFL);
+      if (flags < 0 || fcntl(rec.fd, F_SETFL, v ? flags | O_NONBLOCK : flags & ~O_NONBLOCK) < 0) {
+        return ZEL_FAILURE;
+      }
+    }
+  }
   rec.options.push_back({level, option, v});
   return ZEL_OK;
 }
@@ -220,13 +276,31 @@ ZelStatus zel_SocketSendTo(ZelSocket sock, int32_t flags, const void* addr, cons
   if (ZelStatus s = Faults::Check("zel_SocketSendTo")) return s;
   host::SocketState& st = host::Socks();
   std::lock_guard<std::mutex> g(st.mu);
-  host::OpenSocket(st, sock, __func__);
+  host::SocketRecord& rec = host::OpenSocket(st, sock, __func__);
   if (addr == nullptr || (buf == nullptr && len != 0)) return ZEL_BAD_PARAM;
   // A BSD IPv4 socket address: length 16, family, port (network order),
   // address, 8 bytes of zero padding.
   uint8_t sa[16];
   std::memcpy(sa, addr, sizeof sa);
   if (sa[0] != sizeof sa || sa[1] != ZEL_AF_INET) return ZEL_BAD_PARAM;
+  if (rec.fd >= 0) {
+    sockaddr_in dest{};
+    dest.sin_family = AF_INET;
+    std::memcpy(&dest.sin_port, sa + 2, 2);
+    std::memcpy(&dest.sin_addr, sa + 4, 4);
+    // The kernel adds the IPv4 header and routes; a full queue or an
+    // unreachable destination loses the copy, as on a real host.
+    ssize_t n = sendto(rec.fd, buf, len, MSG_NOSIGNAL,
+                       reinterpret_cast<const sockaddr*>(&dest), sizeof dest);
+    if (n < 0) {
+      st.sendErrors++;
+      return errno == EAGAIN || errno == EWOULDBLOCK ? ZEL_WOULD_BLOCK : ZEL_FAILURE;
+    }
+    st.sentCount++;
+    if (sent != nullptr) *sent = static_cast<size_t>(n);
+    return ZEL_OK;
+  }
+  st.sentCount++;
   host::SentDatagram d;
   d.socket = sock;
   d.family = sa[1];
@@ -243,6 +317,11 @@ ZelStatus zel_SocketSendTo(ZelSocket sock, int32_t flags, const void* addr, cons
 void zel_SocketClose(ZelSocket sock) {
   host::SocketState& st = host::Socks();
   std::lock_guard<std::mutex> g(st.mu);
-  host::OpenSocket(st, sock, __func__).info.open = false;
+  host::SocketRecord& rec = host::OpenSocket(st, sock, __func__);
+  rec.info.open = false;
+  if (rec.fd >= 0) {
+    close(rec.fd);
+    rec.fd = -1;
+  }
   st.open--;
 }

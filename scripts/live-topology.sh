@@ -1,0 +1,53 @@
+# Network namespaces for running sluice-host on live traffic; sourced by
+# scripts/live-demo.sh and the service tests.
+#
+#   topo_up P     makes namespaces P-vm, P-net, P-fp and P-gre:
+#                   P-vm  eth0 10.77.0.1/24 ── vmside ┐
+#                                                      P-fp (sluice-host)
+#                   P-net eth0 10.77.0.2/24 ── swside ┘   g0 10.78.0.1/24
+#                   P-gre g1 10.78.0.2/24 ──────────────── g0
+#                 sluice-host runs in P-fp with a port between vmside
+#                 (VM side) and swside (switch side); GRE copies for
+#                 10.78.0.2 reach P-gre through P-fp's routing.
+#   topo_down P   removes them (safe to call more than once).
+#
+# Senders have checksum and segmentation offload turned off so every frame
+# read from an interface is complete.
+
+topo_down() {
+  local p=$1 ns
+  for ns in vm net fp gre; do
+    ip netns del "$p-$ns" 2>/dev/null || true
+  done
+}
+
+topo_up() {
+  local p=$1 ns
+  topo_down "$p"
+  for ns in vm net fp gre; do ip netns add "$p-$ns" || return 1; done
+  ip -n "$p-fp" link add vmside type veth peer name eth0 netns "$p-vm" || return 1
+  ip -n "$p-fp" link add swside type veth peer name eth0 netns "$p-net" || return 1
+  ip -n "$p-fp" link add g0 type veth peer name g1 netns "$p-gre" || return 1
+  ip -n "$p-vm" addr add 10.77.0.1/24 dev eth0
+  ip -n "$p-net" addr add 10.77.0.2/24 dev eth0
+  ip -n "$p-fp" addr add 10.78.0.1/24 dev g0
+  ip -n "$p-gre" addr add 10.78.0.2/24 dev g1
+  for ns in vm net fp gre; do ip -n "$p-$ns" link set lo up; done
+  ip -n "$p-vm" link set eth0 address 02:00:00:00:77:01
+  ip -n "$p-net" link set eth0 address 02:00:00:00:77:02
+  ip -n "$p-vm" link set eth0 up
+  ip -n "$p-net" link set eth0 up
+  ip -n "$p-fp" link set vmside up
+  ip -n "$p-fp" link set swside up
+  ip -n "$p-fp" link set g0 up
+  ip -n "$p-gre" link set g1 up
+  # IPv6 autoconfiguration would put stray frames on the wire.
+  for ns in vm net fp gre; do
+    ip netns exec "$p-$ns" sysctl -qw net.ipv6.conf.all.disable_ipv6=1 2>/dev/null || true
+  done
+  if command -v ethtool >/dev/null 2>&1; then
+    ip netns exec "$p-vm" ethtool -K eth0 tx off tso off gso off >/dev/null 2>&1
+    ip netns exec "$p-net" ethtool -K eth0 tx off tso off gso off >/dev/null 2>&1
+  fi
+  return 0
+}

@@ -1,0 +1,344 @@
+// The control protocol's framing and bounds, and a running sluice-host
+// facing hostile clients: every malformed request gets an error reply, the
+// host keeps serving and the module heap is what it was.
+#include <fcntl.h>
+#include <gtest/gtest.h>
+#include <signal.h>
+#include <sys/socket.h>
+#include <sys/stat.h>
+#include <sys/wait.h>
+#include <unistd.h>
+
+#include <chrono>
+#include <cstring>
+#include <fstream>
+#include <random>
+#include <string>
+#include <thread>
+
+#include "service/protocol/protocol.h"
+
+namespace {
+
+using slcproto::Message;
+using slcproto::Type;
+using Bytes = std::vector<uint8_t>;
+
+Bytes Header(uint32_t magic, uint16_t version, uint16_t type, uint32_t argsLen, uint32_t blobLen) {
+  Bytes b(16);
+  std::memcpy(b.data(), &magic, 4);
+  std::memcpy(b.data() + 4, &version, 2);
+  std::memcpy(b.data() + 6, &type, 2);
+  std::memcpy(b.data() + 8, &argsLen, 4);
+  std::memcpy(b.data() + 12, &blobLen, 4);
+  return b;
+}
+
+TEST(ServiceProtocol, RoundTripsArgumentsAndBlob) {
+  Message m;
+  m.type = Type::kRulesetWrite;
+  m.args["filter"] = "vm1.eth0";
+  m.blob = {0, 1, 2, 0xff};
+  Bytes wire = slcproto::Encode(m);
+  slcproto::Header h;
+  std::string error;
+  ASSERT_TRUE(slcproto::ParseHeader(wire, &h, &error)) << error;
+  Message back;
+  ASSERT_TRUE(slcproto::ParseBody(h, std::span(wire).subspan(16), &back, &error)) << error;
+  EXPECT_EQ(back.type, Type::kRulesetWrite);
+  EXPECT_EQ(back.args["filter"], "vm1.eth0");
+  EXPECT_EQ(back.blob, m.blob);
+}
+
+TEST(ServiceProtocol, RefusesHeadersOutsideTheBounds) {
+  struct Case {
+    const char* what;
+    Bytes header;
+  } cases[] = {
+      {"short", Bytes(15, 0)},
+      {"bad magic", Header(0x12345678, 1, 0x100, 0, 0)},
+      {"future version", Header(slcproto::kMagic, 2, 0x100, 0, 0)},
+      {"arguments too long", Header(slcproto::kMagic, 1, 0x100, slcproto::kMaxArgs + 1, 0)},
+      {"blob too long", Header(slcproto::kMagic, 1, 0x100, 0, slcproto::kMaxBlob + 1)},
+      {"blob length wraps", Header(slcproto::kMagic, 1, 0x100, 0, UINT32_MAX)},
+  };
+  for (const auto& c : cases) {
+    slcproto::Header h;
+    std::string error;
+    EXPECT_FALSE(slcproto::ParseHeader(c.header, &h, &error)) << c.what;
+    EXPECT_FALSE(error.empty()) << c.what;
+  }
+}
+
+TEST(ServiceProtocol, RefusesBodiesThatAreNotAnObject) {
+  for (const std::string& args :
+       std::vector<std::string>{"[1,2]", "{\"a\":", "\"text\"", std::string("\xff\xfe", 2)}) {
+    slcproto::Header h{slcproto::kVersion, 0x100, static_cast<uint32_t>(args.size()), 0};
+    Message out;
+    std::string error;
+    EXPECT_FALSE(slcproto::ParseBody(
+        h, std::span(reinterpret_cast<const uint8_t*>(args.data()), args.size()), &out, &error))
+        << args;
+  }
+  slcproto::Header h{slcproto::kVersion, 0x100, 2, 3};
+  Message out;
+  std::string error;
+  EXPECT_FALSE(slcproto::ParseBody(h, Bytes(4, '{'), &out, &error)) << "length mismatch";
+}
+
+// A sluice-host with one agent and no ports, on a socket in a fresh
+// directory; killed on every path.
+class ServiceHostTest : public ::testing::Test {
+ protected:
+  void SetUp() override {
+    char tmpl[] = "/tmp/sluice-ctl-test.XXXXXX";
+    ASSERT_NE(mkdtemp(tmpl), nullptr);
+    dir_ = tmpl;
+    sock_ = dir_ + "/ctl.sock";
+    pid_ = fork();
+    ASSERT_GE(pid_, 0);
+    if (pid_ == 0) {
+      int devnull = open("/dev/null", O_WRONLY);
+      dup2(devnull, 2);
+      execl(SLUICE_HOST_BIN, "sluice-host", "--socket", sock_.c_str(), "--gre", "memory", "--agent",
+            "fw:default-action=ACTION_ACCEPT", "--max-seconds", "60", static_cast<char*>(nullptr));
+      _exit(127);
+    }
+    for (int i = 0; i < 100; i++) {
+      Message r;
+      std::string error;
+      if (Request(Type::kHello, &r)) return;
+      std::this_thread::sleep_for(std::chrono::milliseconds(50));
+    }
+    FAIL() << "sluice-host did not come up";
+  }
+  void TearDown() override {
+    if (pid_ > 0) {
+      kill(pid_, SIGKILL);
+      waitpid(pid_, nullptr, 0);
+    }
+    unlink(sock_.c_str());
+    rmdir(dir_.c_str());
+  }
+  // Stops the host with SIGTERM and returns its exit status.
+  int Stop() {
+    kill(pid_, SIGTERM);
+    int status = 0;
+    waitpid(pid_, &status, 0);
+    pid_ = -1;
+    return WIFEXITED(status) ? WEXITSTATUS(status) : 128 + WTERMSIG(status);
+  }
+
+  bool Request(Type type, Message* reply, nlohmann::json args = nlohmann::json::object(),
+               Bytes blob = {}) {
+    Message m;
+    m.type = type;
+    m.args = std::move(args);
+    m.blob = std::move(blob);
+    std::string error;
+    return slcproto::Call(sock_, m, reply, &error, 5000);
+  }
+  uint64_t HeapBytes() {
+    Message r;
+    if (!Request(Type::kStats, &r)) return UINT64_MAX;
+    return r.args.value("heapBytes", uint64_t{0});
+  }
+  // Writes raw bytes, half-closes, and returns the reply (if one came).
+  bool RawExchange(const Bytes& bytes, Message* reply) {
+    std::string error;
+    int fd = slcproto::Connect(sock_, &error);
+    if (fd < 0) return false;
+    (void)!write(fd, bytes.data(), bytes.size());
+    shutdown(fd, SHUT_WR);
+    bool ok = slcproto::ReadMessage(fd, reply, &error, 5000);
+    close(fd);
+    return ok;
+  }
+
+  std::string dir_, sock_;
+  pid_t pid_ = -1;
+};
+
+TEST_F(ServiceHostTest, SocketIsPrivateToItsOwner) {
+  struct stat st {};
+  ASSERT_EQ(stat(sock_.c_str(), &st), 0);
+  EXPECT_EQ(st.st_mode & 0777, 0600u);
+}
+
+TEST_F(ServiceHostTest, MalformedRequestsGetAnErrorAndChangeNothing) {
+  const uint64_t heap = HeapBytes();
+  ASSERT_NE(heap, UINT64_MAX);
+  std::mt19937 rng(9);
+  Bytes random(300);
+  for (auto& b : random) b = static_cast<uint8_t>(rng());
+  Message valid;
+  valid.type = Type::kHello;
+  Bytes truncated = slcproto::Encode(valid);
+  truncated.resize(truncated.size() - 1);
+  std::string badJson = "{\"filter\": ";
+  Bytes badJsonMsg = Header(slcproto::kMagic, 1, 0x105, static_cast<uint32_t>(badJson.size()), 0);
+  badJsonMsg.insert(badJsonMsg.end(), badJson.begin(), badJson.end());
+  const struct {
+    const char* what;
+    Bytes bytes;
+  } raw[] = {
+      {"random bytes", random},
+      {"truncated header", Bytes(truncated.begin(), truncated.begin() + 9)},
+      {"truncated body", Header(slcproto::kMagic, 1, 0x100, 10, 0)},
+      {"oversized blob", Header(slcproto::kMagic, 1, 0x105, 0, slcproto::kMaxBlob + 1)},
+      {"arguments not JSON", badJsonMsg},
+  };
+  for (const auto& c : raw) {
+    Message reply;
+    ASSERT_TRUE(RawExchange(c.bytes, &reply)) << c.what;
+    EXPECT_FALSE(reply.args.value("ok", true)) << c.what;
+    EXPECT_FALSE(reply.args.value("error", std::string()).empty()) << c.what;
+  }
+
+  // Well-framed requests with wrong, missing or hostile arguments.
+  const struct {
+    Type type;
+    nlohmann::json args;
+    Bytes blob;
+  } requests[] = {
+      {static_cast<Type>(0x7777), {}, {}},
+      {Type::kMigrationFirst, {}, {}},
+      {Type::kRulesetWrite, {{"filter", 5}}, Bytes(20, 0)},
+      {Type::kRulesetWrite, {{"filter", "no-such-port"}}, Bytes(20, 0)},
+      {Type::kRulesetRead, {}, {}},
+      {Type::kCreateAgent, {{"text", std::string(5000, 'a')}}, {}},
+      {Type::kCreateAgent, {{"text", nlohmann::json::array()}}, {}},
+      {Type::kAddPort,
+       {{"port", {{"name", "p"}, {"agent", "fw"}, {"vm", "nope0"}, {"switch", "nope1"}}}},
+       {}},
+      {Type::kAddPort, {{"port", {{"name", "p"}, {"vnic", -1}}}}, {}},
+      {Type::kRemovePort, {{"name", "p"}}, {}},
+      {Type::kDevSetRuleset, {{"uuid", "u"}, {"vnic", 1}, {"agent", "fw"}}, Bytes(3, 0)},
+      {Type::kDevGetRuleset, {{"filter", std::string(500, 'f')}}, {}},
+      {Type::kDevTestIoctl, {{"filter", "none"}, {"agent", "no-such-agent"}}, {}},
+      {Type::kStatus, {{"maxRules", "many"}}, {}},
+  };
+  for (const auto& r : requests) {
+    Message reply;
+    ASSERT_TRUE(Request(r.type, &reply, r.args, r.blob)) << static_cast<int>(r.type);
+    EXPECT_FALSE(reply.args.value("ok", true)) << r.args.dump();
+  }
+
+  Message hello;
+  ASSERT_TRUE(Request(Type::kHello, &hello));
+  EXPECT_TRUE(hello.args.value("ok", false));
+  EXPECT_EQ(HeapBytes(), heap);
+  EXPECT_EQ(Stop(), 0);
+}
+
+TEST_F(ServiceHostTest, ASilentClientCannotHoldOffOthers) {
+  std::string error;
+  const int silent = slcproto::Connect(sock_, &error);
+  ASSERT_GE(silent, 0) << error;
+  const auto start = std::chrono::steady_clock::now();
+  Message hello, reply;
+  hello.type = Type::kHello;
+  ASSERT_TRUE(slcproto::Call(sock_, hello, &reply, &error, 15000)) << error;
+  EXPECT_TRUE(reply.args.value("ok", false));
+  EXPECT_LT(std::chrono::steady_clock::now() - start, std::chrono::seconds(10));
+  close(silent);
+}
+
+TEST_F(ServiceHostTest, AgentsAreCreatedThroughTheCreateAgentProperty) {
+  Message reply;
+  ASSERT_TRUE(Request(Type::kCreateAgent, &reply, {{"text", "second:default-action=ACTION_DROP"}}));
+  EXPECT_TRUE(reply.args.value("ok", false)) << reply.args.dump();
+  ASSERT_TRUE(Request(Type::kCreateAgent, &reply, {{"text", "second"}}));
+  EXPECT_FALSE(reply.args.value("ok", true)) << "a second agent of the same name";
+
+  ASSERT_TRUE(Request(Type::kStatus, &reply, {{"agent", "second"}}));
+  ASSERT_TRUE(reply.args.value("ok", false)) << reply.args.dump();
+  ASSERT_EQ(reply.args["agents"].size(), 1u);
+  EXPECT_EQ(reply.args["agents"][0]["name"], "second");
+  EXPECT_TRUE(reply.args["agents"][0]["filters"].empty());
+  EXPECT_EQ(Stop(), 0);
+}
+
+TEST_F(ServiceHostTest, PeersOfAnotherUserAreRefused) {
+  if (geteuid() != 0) GTEST_SKIP() << "needs root to connect as another user";
+  // Opening the file to everyone leaves the credential check as the only
+  // guard.
+  ASSERT_EQ(chmod(sock_.c_str(), 0666), 0);
+  ASSERT_EQ(chmod(dir_.c_str(), 0755), 0);
+  pid_t child = fork();
+  ASSERT_GE(child, 0);
+  if (child == 0) {
+    if (setgid(65534) != 0 || setuid(65534) != 0) _exit(10);
+    Message hello, reply;
+    hello.type = Type::kHello;
+    std::string error;
+    if (!slcproto::Call(sock_, hello, &reply, &error, 5000)) {
+      std::fprintf(stderr, "%s\n", error.c_str());
+      _exit(11);
+    }
+    _exit(reply.args.value("ok", true) ? 12 : 0);
+  }
+  int status = 0;
+  waitpid(child, &status, 0);
+  ASSERT_TRUE(WIFEXITED(status));
+  EXPECT_EQ(WEXITSTATUS(status), 0) << "10: setuid, 11: no reply, 12: accepted";
+  Message hello;
+  EXPECT_TRUE(Request(Type::kHello, &hello));
+}
+
+// Settings from a file: the host takes its socket and agents from it, and
+// refuses a file with an unknown setting before loading anything.
+TEST(ServiceHostConfig, ReadsSettingsFromAFileAndRefusesUnknownOnes) {
+  char tmpl[] = "/tmp/sluice-cfg-test.XXXXXX";
+  ASSERT_NE(mkdtemp(tmpl), nullptr);
+  const std::string dir = tmpl, sock = dir + "/c.sock", good = dir + "/good.conf",
+                    bad = dir + "/bad.conf";
+  std::ofstream(good) << "# a host from a file\n"
+                      << "socket " << sock << "\n"
+                      << "agent cfg:default-action=ACTION_DROP   # trailing comment\n"
+                      << "gre memory\n";
+  std::ofstream(bad) << "agent x\nbogus 1\n";
+  auto spawn = [](const std::string& config) {
+    pid_t pid = fork();
+    if (pid == 0) {
+      int devnull = open("/dev/null", O_WRONLY);
+      dup2(devnull, 2);
+      execl(SLUICE_HOST_BIN, "sluice-host", "--config", config.c_str(), "--max-seconds", "30",
+            static_cast<char*>(nullptr));
+      _exit(127);
+    }
+    return pid;
+  };
+  auto exitStatus = [](pid_t pid) {
+    int status = 0;
+    waitpid(pid, &status, 0);
+    return WIFEXITED(status) ? WEXITSTATUS(status) : 128 + WTERMSIG(status);
+  };
+
+  EXPECT_EQ(exitStatus(spawn(bad)), 2);
+
+  pid_t pid = spawn(good);
+  ASSERT_GT(pid, 0);
+  Message status;
+  bool up = false;
+  for (int i = 0; i < 100 && !up; i++) {
+    Message req;
+    req.type = Type::kStatus;
+    req.args["agent"] = "cfg";
+    std::string error;
+    up = slcproto::Call(sock, req, &status, &error, 5000);
+    if (!up) std::this_thread::sleep_for(std::chrono::milliseconds(50));
+  }
+  EXPECT_TRUE(up);
+  if (up) {
+    ASSERT_EQ(status.args["agents"].size(), 1u);
+    EXPECT_EQ(status.args["agents"][0]["name"], "cfg");
+  }
+  kill(pid, SIGTERM);
+  EXPECT_EQ(exitStatus(pid), 0);
+  unlink(good.c_str());
+  unlink(bad.c_str());
+  rmdir(dir.c_str());
+}
+
+}  // namespace

@@ -1,0 +1,192 @@
+#!/usr/bin/env bash
+# sluice-host on live traffic: namespaces "vm" and "net" joined through
+# sluice-host, rules loaded and changed with sluice-ctl while traffic flows,
+# GRE copies captured in a third namespace, DSCP marks and L2 rewrite seen
+# on the wire. Needs root; exits 77 (skipped) otherwise.
+#
+#   live_test.sh SLUICE_HOST SLUICE_CTL
+set -u
+HOST_BIN=$1
+CTL_BIN=$2
+HERE=$(cd "$(dirname "$0")/../.." && pwd)
+
+if [ "$(id -u)" -ne 0 ]; then
+  echo "SKIP: needs root to make network namespaces"
+  exit 77
+fi
+for tool in ip ping socat tcpdump timeout; do
+  if ! command -v $tool >/dev/null 2>&1; then
+    echo "SKIP: $tool is not installed (scripts/install-deps.sh installs it)"
+    exit 77
+  fi
+done
+
+. "$HERE/scripts/live-topology.sh"
+P="slt$$"
+DIR=$(mktemp -d /tmp/sluice-live.XXXXXX)
+SOCK="$DIR/ctl.sock"
+HOST_PID=""
+FAILED=0
+
+cleanup() {
+  if [ -n "$HOST_PID" ] && kill -0 "$HOST_PID" 2>/dev/null; then
+    kill -KILL "$HOST_PID" 2>/dev/null
+  fi
+  topo_down "$P"
+  [ -n "${KEEP_DIR:-}" ] || rm -rf "$DIR"
+}
+trap cleanup EXIT
+trap 'exit 1' INT TERM
+
+ctl() { timeout 10 "$CTL_BIN" --socket "$SOCK" "$@"; }
+check() {  # check NAME COMMAND...
+  local name=$1; shift
+  if "$@"; then echo "ok   $name"; else echo "FAIL $name"; FAILED=1; fi
+}
+in_ns() { local ns=$1; shift; ip netns exec "$P-$ns" "$@"; }
+set_rules() { printf '%s\n' "$@" | ctl ruleset set vm1.eth0 - >/dev/null; }
+# Sends COUNT UDP datagrams from vm to net port PORT (one line each).
+send_udp() {  # send_udp FROM_NS TO_ADDR PORT COUNT [PAYLOAD_BYTES]
+  local from=$1 addr=$2 port=$3 count=$4 size=${5:-16} i
+  local payload; payload=$(head -c "$size" /dev/zero | tr '\0' 'x')
+  for ((i = 0; i < count; i++)); do
+    echo "$payload" | in_ns "$from" timeout 2 socat -u - "UDP-SENDTO:$addr:$port" 2>/dev/null
+  done
+}
+# Receives UDP datagrams on PORT in namespace NS for SECONDS into FILE.
+recv_udp() {  # recv_udp NS PORT SECONDS FILE
+  # Started through ip directly (not a function) so that $! is the
+  # receiver and killing it ends it.
+  ip netns exec "$P-$1" timeout "$3" socat -u "UDP-RECV:$2" - >"$4" 2>/dev/null &
+  LAST_RECV=$!
+}
+rule_packets() {  # rule_packets INDEX: packet counter of rule INDEX
+  sleep 0.3  # the last frames may still sit in a receive ring block
+  ctl --json status --agent fw | python3 -c '
+import json, sys
+t = json.load(sys.stdin)
+rules = t["agents"][0]["filters"][0]["rules"]
+print(next(r["pktCount"] for r in rules if r["rule"] == sys.argv[1]))' "$1"
+}
+
+topo_up "$P" || { echo "FAIL could not make namespaces"; exit 1; }
+# Started directly (not through a function) so that $! is the host itself.
+ip netns exec "$P-fp" "$HOST_BIN" --socket "$SOCK" --gre kernel --max-seconds 80 \
+  --agent 'fw:default-action=ACTION_ACCEPT' \
+  --port name=vm1.eth0,agent=fw,vm=vmside,switch=swside,uuid=564d-live,vnic=3 \
+  2>"$DIR/host.log" &
+HOST_PID=$!
+for _ in $(seq 50); do ctl hello >/dev/null 2>&1 && break; sleep 0.1; done
+check "host answers" ctl hello
+HEAP0=$(ctl --json stats | python3 -c 'import json,sys; print(json.load(sys.stdin)["heapBytes"])')
+
+# --- ping, UDP, TCP pass or drop as the rules say ---------------------------
+check "ping passes with no rules" in_ns vm ping -c 2 -i 0.2 -W 1 -q 10.77.0.2
+set_rules "action=drop ipv4 proto=icmp" "action=drop ipv4 proto=udp dport=6000" \
+  "action=drop ipv4 proto=tcp dport=7001"
+check "ping dropped by an icmp rule" bash -c "! ip netns exec $P-vm ping -c 2 -i 0.2 -W 1 -q 10.77.0.2"
+
+recv_udp net 5000 3 "$DIR/u5000"; R1=$LAST_RECV; recv_udp net 6000 3 "$DIR/u6000"; R2=$LAST_RECV
+sleep 0.3
+send_udp vm 10.77.0.2 5000 5; send_udp vm 10.77.0.2 6000 5; wait $R1 $R2
+check "udp to an open port arrives" test "$(wc -l <"$DIR/u5000")" -eq 5
+check "udp to a dropped port does not" test "$(wc -l <"$DIR/u6000")" -eq 0
+
+ip netns exec "$P-net" timeout 5 socat -u TCP-LISTEN:7000,reuseaddr - >"$DIR/t7000" 2>/dev/null &
+T1=$!
+ip netns exec "$P-net" timeout 5 socat -u TCP-LISTEN:7001,reuseaddr - >"$DIR/t7001" 2>/dev/null &
+T2=$!
+sleep 0.3
+echo "hello over tcp" | in_ns vm timeout 3 socat -u - TCP:10.77.0.2:7000,connect-timeout=2 2>/dev/null
+echo "blocked" | in_ns vm timeout 3 socat -u - TCP:10.77.0.2:7001,connect-timeout=2 2>/dev/null
+check "tcp exchange on an open port" grep -q "hello over tcp" "$DIR/t7000"
+check "tcp to a dropped port does not connect" test ! -s "$DIR/t7001"
+kill $T1 $T2 2>/dev/null; wait $T1 $T2 2>/dev/null
+
+# --- counters equal what was sent ---------------------------------------------
+set_rules "action=accept ipv4 proto=udp dport=5100" "action=drop ipv4 proto=udp dport=5101"
+send_udp vm 10.77.0.2 5100 12; send_udp vm 10.77.0.2 5101 7
+check "accept counter equals datagrams sent" test "$(rule_packets 0)" = 12
+check "drop counter equals datagrams sent" test "$(rule_packets 1)" = 7
+
+# --- rules changed while traffic flows lose no accepted packet ----------------
+recv_udp net 5200 30 "$DIR/u5200"; sleep 0.3
+( send_udp vm 10.77.0.2 5200 150 ) &
+SENDER=$!
+for i in $(seq 15); do
+  set_rules "action=accept ipv4 proto=udp dport=5200" "action=drop ipv4 proto=udp dport=$((6100 + i))"
+  set_rules "action=drop ipv4 proto=tcp dport=$((6200 + i))" "action=accept ipv4 proto=udp dport=5200"
+done
+wait $SENDER; sleep 0.5; kill $LAST_RECV 2>/dev/null; wait $LAST_RECV 2>/dev/null
+check "no accepted datagram lost across 30 rule changes" test "$(wc -l <"$DIR/u5200")" -eq 150
+
+# --- GRE mirror captured in a third namespace ---------------------------------
+set_rules "action=gre gre=10.78.0.2 snaplen=64 ipv4 proto=udp dport=5300" \
+  "action=dscp dscp=46 ipv4 proto=udp dport=5400" \
+  "action=l2rewrite rewrite=02:00:00:00:77:99 ipv4 proto=udp dport=5500"
+ip netns exec "$P-gre" timeout 10 tcpdump --immediate-mode -i g1 -U -w "$DIR/gre.pcap" proto gre 2>"$DIR/c1.err" &
+C1=$!
+ip netns exec "$P-net" timeout 10 tcpdump --immediate-mode -i eth0 -U -w "$DIR/net.pcap" udp 2>"$DIR/c2.err" &
+C2=$!
+# Capturing starts when tcpdump says it is listening.
+for _ in $(seq 50); do
+  grep -q listening "$DIR/c1.err" && grep -q listening "$DIR/c2.err" && break
+  sleep 0.1
+done
+send_udp vm 10.77.0.2 5300 4 300
+send_udp vm 10.77.0.2 5400 3
+send_udp net 10.77.0.1 5500 3
+sleep 1  # frames still in the filter's receive ring, copies still in flight
+kill -INT $C1 $C2 2>/dev/null; wait $C1 $C2 2>/dev/null
+GRE_COUNT=$(tcpdump -r "$DIR/gre.pcap" -nn 2>/dev/null | wc -l)
+check "4 GRE copies captured" test "$GRE_COUNT" -eq 4
+# Outer IPv4 (20) + GRE (4) + the mirrored frame cut at 64 bytes.
+check "GRE copies carry the frame cut at the snap length" \
+  bash -c "tcpdump -r '$DIR/gre.pcap' -nn -v 2>/dev/null | grep -c 'length 88' | grep -qx 4"
+check "DSCP mark on the wire with a valid IPv4 checksum" \
+  bash -c "tcpdump -r '$DIR/net.pcap' -nn -v 'udp dst port 5400' 2>/dev/null | grep 'tos 0xb8' | grep -vc 'bad cksum' | grep -qx 3"
+check "L2 rewrite turns frames back toward the switch with the new MAC" \
+  bash -c "tcpdump -r '$DIR/net.pcap' -nn -e 'ether dst 02:00:00:00:77:99 and udp dst port 5500' 2>/dev/null | wc -l | grep -qx 3"
+
+# --- the device channel, by name and by VM UUID --------------------------------
+printf 'action=drop ipv4 proto=udp dport=5600\n' >"$DIR/dev.rules"
+check "device set by uuid and vnic" ctl dev set --uuid 564d-live --vnic 3 "$DIR/dev.rules"
+check "device get by name shows it" bash -c "'$CTL_BIN' --socket '$SOCK' dev get --filter vm1.eth0 | grep -q 'dport=5600'"
+check "device test ioctl" ctl dev test --filter vm1.eth0
+
+# --- hostile rulesets on a live filter: refused, host up, heap unchanged -------
+HEAP1=$(ctl --json stats | python3 -c 'import json,sys; print(json.load(sys.stdin)["heapBytes"])')
+ctl ruleset get vm1.eth0 --wire "$DIR/good.bin"
+python3 - "$DIR" <<'PY'
+import struct, sys
+d = sys.argv[1]
+good = open(d + "/good.bin", "rb").read()
+# header claims far more rules than follow; a header cut short; random bytes
+open(d + "/many.bin", "wb").write(good[:3] + struct.pack("<I", 0xFFFFFFFF) + good[7:])
+open(d + "/short.bin", "wb").write(good[:9])
+import random
+random.seed(9)
+open(d + "/noise.bin", "wb").write(bytes(random.randrange(256) for _ in range(700)))
+PY
+for f in many short noise; do
+  check "property refuses a $f ruleset" bash -c "! '$CTL_BIN' --socket '$SOCK' ruleset set vm1.eth0 --wire '$DIR/$f.bin' 2>/dev/null"
+  check "device refuses a $f ruleset" bash -c "! '$CTL_BIN' --socket '$SOCK' dev set --filter vm1.eth0 --wire '$DIR/$f.bin' 2>/dev/null"
+done
+check "the rules in force survive hostile rulesets" bash -c "'$CTL_BIN' --socket '$SOCK' ruleset get vm1.eth0 | grep -q 'dport=5600'"
+HEAP2=$(ctl --json stats | python3 -c 'import json,sys; print(json.load(sys.stdin)["heapBytes"])')
+check "heap unchanged by hostile rulesets ($HEAP1 -> $HEAP2)" test "$HEAP1" = "$HEAP2"
+
+# --- ports come and go while the host runs --------------------------------------
+check "remove the port" ctl remove-port vm1.eth0
+check "ping fails with no port" bash -c "! ip netns exec $P-vm ping -c 1 -W 1 -q 10.77.0.2"
+check "add it back" ctl add-port name=vm1.eth0,agent=fw,vm=vmside,switch=swside
+check "ping passes through the new filter" in_ns vm ping -c 2 -i 0.2 -W 1 -q 10.77.0.2
+
+# --- clean stop ------------------------------------------------------------------
+kill -TERM "$HOST_PID"
+wait "$HOST_PID"; RC=$?
+HOST_PID=""
+check "host exits 0 on SIGTERM with nothing left behind" test "$RC" -eq 0
+[ "$RC" -eq 0 ] || cat "$DIR/host.log"
+echo "heap at start: $HEAP0 bytes"
+exit $FAILED
