@@ -133,8 +133,9 @@ ZelStatus SLCGenericInitFastPathAgent(char* createText) {
     SLCG_LOG_OBJ(SLCG_ATTENTION, agent->name, "Failed to register agent (%#x): %s", status,
                  zel_StatusToString(status));
     // The framework destroys whatever filters it created meanwhile.
-    if (zel_SluiceUnregisterFastPath(fp->fastPathHandle) != ZEL_OK) {
-      SLCG_LOG_OBJ(SLCG_ATTENTION, agent->name, "Failed to unregister agent");
+    if (ZelStatus unreg = zel_SluiceUnregisterFastPath(fp->fastPathHandle); unreg != ZEL_OK) {
+      SLCG_LOG_OBJ(SLCG_ATTENTION, agent->name, "Failed to unregister agent (%#x): %s", unreg,
+                   zel_StatusToString(unreg));
     }
     fp->fastPathHandle = nullptr;
     DestroyAgentLock(fp);
@@ -217,8 +218,9 @@ void SLCGenericCleanupFastPathAgent(SLCGenericAgent* agent) {
   if (fp->fastPathHandle != nullptr) {
     // Returns once the framework has destroyed our filters and unregistered
     // our slow paths through our own callbacks.
-    if (zel_SluiceUnregisterFastPath(fp->fastPathHandle) != ZEL_OK) {
-      SLCG_LOG_OBJ(SLCG_ATTENTION, agent->name, "Failed to unregister agent");
+    if (ZelStatus unreg = zel_SluiceUnregisterFastPath(fp->fastPathHandle); unreg != ZEL_OK) {
+      SLCG_LOG_OBJ(SLCG_ATTENTION, agent->name, "Failed to unregister agent (%#x): %s", unreg,
+                   zel_StatusToString(unreg));
     }
     fp->fastPathHandle = nullptr;
   }

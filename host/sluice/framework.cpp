@@ -340,8 +340,8 @@ ZelStatus zel_SluiceGetConfigParameter(ZelSluiceFilterHandle filter, uint32_t nu
 namespace {
 
 ZelStatus TakeOver(ZelSluiceFilterHandle filter, ZelPktList* list, uint32_t direction,
-                   const char* call, bool faulted) {
-  ZelStatus injected = Faults::Check(call);
+                   const char* call, bool faulted, const void* site) {
+  ZelStatus injected = Faults::Check(call, site);
   std::vector<ZelPkt*> pkts;
   {
     std::lock_guard<std::mutex> g(S().mu);
@@ -364,12 +364,14 @@ ZelStatus TakeOver(ZelSluiceFilterHandle filter, ZelPktList* list, uint32_t dire
 
 ZelStatus zel_SluiceFaultPackets(ZelSluiceFilterHandle filter, ZelPktList* list,
                                  uint32_t direction, uint32_t /*flags*/) {
-  return TakeOver(filter, list, direction, "zel_SluiceFaultPackets", true);
+  return TakeOver(filter, list, direction, "zel_SluiceFaultPackets", true,
+                  __builtin_return_address(0));
 }
 
 ZelStatus zel_SluiceIssuePackets(ZelSluiceFilterHandle filter, ZelPktList* list,
                                  uint32_t direction) {
-  return TakeOver(filter, list, direction, "zel_SluiceIssuePackets", false);
+  return TakeOver(filter, list, direction, "zel_SluiceIssuePackets", false,
+                  __builtin_return_address(0));
 }
 
 // ---------------------------------------------------------------------------
