@@ -59,6 +59,10 @@ void Finish(host::FilterId id) {
     std::fprintf(stderr, "fuzz: filter could not be destroyed\n");
     std::abort();
   }
+  // What the host records for tests to inspect (requests with their
+  // payloads, datagrams sent, log lines) is history, not state: kept across
+  // inputs it would grow the process by every input's size.
+  host::Sluice::ClearRequests();
   host::Sockets::ClearSent();
   host::Log::Clear();
   uint64_t blocks = host::Heaps::Stats(slcGenericHeapID).blocks;

@@ -59,6 +59,15 @@ void ForgetFilterLocked(ZelSluiceFilter* f) {
   f->alive = false;
   auto& list = f->agent->filters;
   list.erase(std::remove(list.begin(), list.end(), f), list.end());
+  S().dead.push_back(f->id);
+  while (S().dead.size() > State::kDeadFiltersKept) {
+    auto it = S().filters.find(S().dead.front());
+    S().dead.pop_front();
+    if (it == S().filters.end()) continue;
+    // Packets the test never took back stay counted as live packets.
+    S().handles.erase(it->second.get());
+    S().filters.erase(it);
+  }
 }
 
 ZelStatus CopyText(const std::string& text, char* buf, uint32_t size) {
@@ -112,6 +121,7 @@ void ResetSluice() {
     S().agents.clear();
     S().deadAgents.clear();
     S().filters.clear();
+    S().dead.clear();
     S().handles.clear();
     S().nextFilter = 1;
     ResetRequestsLocked();
