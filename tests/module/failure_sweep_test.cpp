@@ -51,8 +51,8 @@ Bytes EveryAction(uint8_t version = 8) {
   b.Add("action=pooltag pool=gold ipv4 proto=udp dport=4789");
   b.Add("action=log ipv4 proto=tcp dport=25");
   if (version == 8) {
-    b.Add("action=dscp+dot1p dscp=46 dot1p=5 ipv4 sa=10.0.0.0-10.0.0.255");
     b.Add("action=accept rptag=7 ipv4 proto=tcp dport=9");
+    b.Add("action=dscp+dot1p dscp=46 dot1p=5 ipv4 sa=10.0.0.0-10.0.0.255");
   }
   b.Add("action=drop ethtype=0x0806");
   return b.Bytes();
