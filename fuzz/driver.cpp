@@ -4,6 +4,9 @@
 // (default 2000). The seed of every run is its number, so a failure is
 // replayed with --from N --runs 1.
 //
+// --write-seeds DIR writes the target's built-in seeds there (seed-0, ...)
+// and exits: the start of a kept corpus.
+//
 // --rss-growth-kb K fails the run when the resident size after the last
 // mutation exceeds the size after the first tenth of them by more than K:
 // an input must give back what it took, host bookkeeping included.
@@ -89,11 +92,14 @@ int main(int argc, char** argv) {
   long growthLimitKb = -1;
   std::vector<std::string> files;
   std::vector<std::string> dirs;
+  const char* writeSeeds = nullptr;
   for (int i = 1; i < argc; i++) {
     if (!std::strcmp(argv[i], "--runs") && i + 1 < argc) {
       runs = std::strtol(argv[++i], nullptr, 10);
     } else if (!std::strcmp(argv[i], "--from") && i + 1 < argc) {
       from = std::strtol(argv[++i], nullptr, 10);
+    } else if (!std::strcmp(argv[i], "--write-seeds") && i + 1 < argc) {
+      writeSeeds = argv[++i];
     } else if (!std::strcmp(argv[i], "--dir") && i + 1 < argc) {
       dirs.push_back(argv[++i]);
     } else if (!std::strcmp(argv[i], "--rss-growth-kb") && i + 1 < argc) {
@@ -104,6 +110,18 @@ int main(int argc, char** argv) {
   }
   std::vector<std::vector<uint8_t>> seeds;
   SluiceFuzzSeeds(&seeds);
+  if (writeSeeds != nullptr) {
+    for (size_t i = 0; i < seeds.size(); i++) {
+      std::ofstream out(std::string(writeSeeds) + "/seed-" + std::to_string(i), std::ios::binary);
+      out.write(reinterpret_cast<const char*>(seeds[i].data()),
+                static_cast<std::streamsize>(seeds[i].size()));
+      if (!out) {
+        std::fprintf(stderr, "cannot write seeds into %s\n", writeSeeds);
+        return 1;
+      }
+    }
+    return 0;
+  }
   seeds.emplace_back();
   for (const std::string& d : dirs) {
     std::error_code ec;
