@@ -22,6 +22,7 @@ while getopts "t:j:" opt; do
 done
 shift $((OPTIND - 1))
 
+bash scripts/install-deps.sh fuzz
 cmake --preset fuzz >/dev/null
 cmake --build --preset fuzz -j "$jobs"
 build=build/fuzz/fuzz

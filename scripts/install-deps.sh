@@ -1,6 +1,7 @@
 #!/usr/bin/env bash
 # Installs the Debian packages the build needs, when they are missing.
 # Runs apt-get only as root; otherwise it says what is missing and fails.
+#   scripts/install-deps.sh [fuzz]   (fuzz: also clang and its fuzzer runtime)
 set -euo pipefail
 
 need=()
@@ -14,6 +15,10 @@ have_pkg libgtest-dev || need+=(libgtest-dev)
 have_pkg libgmock-dev || need+=(libgmock-dev)
 have_pkg libbenchmark-dev || need+=(libbenchmark-dev)
 have_cmd valgrind || need+=(valgrind)
+if [ "${1:-}" = fuzz ]; then
+  have_cmd clang++ || need+=(clang)
+  have_pkg libclang-rt-dev || need+=(libclang-rt-dev)
+fi
 
 if [ ${#need[@]} -eq 0 ]; then
   exit 0
