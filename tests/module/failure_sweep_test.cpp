@@ -392,3 +392,27 @@ TEST(FailureSweep, EveryReachedPointFailedLeavesNothingAndUndoes) {
 }
 
 }  // namespace
+
+namespace {
+
+// An agent whose creation fails after registering, and whose unregistration
+// then fails too, stays registered: the framework may still call in with
+// it. It must refuse those calls without touching freed memory and be
+// unregistered at unload.
+class FailedUndoTest : public testsupport::HostTest {};
+
+TEST_F(FailedUndoTest, AgentThatCannotBeUnregisteredIsRefusedThenUnregisteredAtUnload) {
+  Faults::Fail("zel_CharDevRegister", ZEL_FAILURE);
+  Faults::Fail("zel_SluiceUnregisterFastPath", ZEL_FAILURE);
+  ASSERT_EQ(host::Loader::Load(&slcGenericModuleImage), 0);
+  EXPECT_TRUE(host::Log::Contains("Failed to unregister agent (0xbad0001): " +
+                                  std::string(zel_StatusToString(ZEL_FAILURE))));
+  ASSERT_TRUE(host::Sluice::AgentRegistered(kAgent));
+  host::FilterId id = 0;
+  EXPECT_NE(host::Sluice::CreateFilter(kAgent, {}, &id), ZEL_OK);
+  host::Loader::Unload();
+  EXPECT_FALSE(host::Sluice::AgentRegistered(kAgent));
+  EXPECT_TRUE(host::Heaps::Leaks().empty());
+}
+
+}  // namespace
