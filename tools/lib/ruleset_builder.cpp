@@ -375,7 +375,7 @@ RuleBuilder& RuleBuilder::Set(std::string_view key, std::string_view value) {
   } else if (key == "pool") {
     if (value.size() >= sizeof(r.resourcePool)) Fail(key, value, "longer than 127 characters");
     std::memset(r.resourcePool, 0, sizeof(r.resourcePool));
-    std::memcpy(r.resourcePool, value.data(), value.size());
+    value.copy(r.resourcePool, value.size());  // `pool=` alone: no bytes, maybe no data
   } else if (key == "dot1p") {
     r.ethDot1PTag = static_cast<uint16_t>(ParseNumber(key, value, 0xffff));
   } else if (key == "dscp") {
