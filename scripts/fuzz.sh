@@ -51,7 +51,7 @@ for t in "${targets[@]}"; do
   # heap and the packets are back where they were; the host's bounded
   # quarantines (released packets, destroyed filters) fill during the first
   # inputs, which libFuzzer would take for leaks and rescan the heap after
-  # each, at a twentieth of the speed. LeakSanitizer still runs at exit.
+  # each, at a twentieth of the speed.
   if ! "$build/$t" -max_total_time="$seconds" -rss_limit_mb=2048 -print_final_stats=1 \
       -detect_leaks=0 \
       -artifact_prefix="$work/$t.crash/" "$work/$t" "$kept" >"$log" 2>&1; then
