@@ -22,6 +22,7 @@
 #include <string>
 #include <vector>
 
+#include <malloc.h>
 #include <unistd.h>
 
 #include "fuzz/fuzz_support.h"
@@ -74,8 +75,12 @@ std::vector<uint8_t> Mutate(std::vector<uint8_t> in, std::mt19937_64& rng) {
   return in;
 }
 
-// Resident set size now, in KB (0 when /proc is not there).
+// Resident set size now, in KB (0 when /proc is not there). Free memory the
+// allocator keeps for reuse goes back to the system first: after a large
+// block is freed, glibc raises its trim threshold and would otherwise keep
+// tens of megabytes that no input holds.
 long ResidentKb() {
+  malloc_trim(0);
   long pages = 0, resident = 0;
   FILE* f = std::fopen("/proc/self/statm", "r");
   if (f == nullptr) return 0;
