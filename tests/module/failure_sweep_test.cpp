@@ -2,7 +2,8 @@
 // filter creation, a slow path, rulesets through the property, the filter
 // ioctl and the device, traffic with every action, read-back, the status
 // tree, save, restore into a second filter, teardown, unload) is run once
-// per failure point the host records, with exactly that point failed.
+// per failure point the host records, with exactly that point failed (the
+// first time it is reached).
 //
 // After each run nothing may be left: heap blocks, packets, sockets, pool
 // tags, locks, framework objects, pending replies, references. Where the
