@@ -9,7 +9,7 @@
 #
 # Prints per target: executions, executions per second, coverage (edges
 # reached of the counters instrumented), features, kept corpus size before
-# and after, resident size at start and end.
+# and after, resident size ten seconds in and at the end, and its peak.
 set -euo pipefail
 cd "$(dirname "$0")/.."
 seconds=60
@@ -52,9 +52,23 @@ for t in "${targets[@]}"; do
   # quarantines (released packets, destroyed filters) fill during the first
   # inputs, which libFuzzer would take for leaks and rescan the heap after
   # each, at a twentieth of the speed.
-  if ! "$build/$t" -max_total_time="$seconds" -rss_limit_mb=2048 -print_final_stats=1 \
+  "$build/$t" -max_total_time="$seconds" -rss_limit_mb=2048 -print_final_stats=1 \
       -detect_leaks=0 \
-      -artifact_prefix="$work/$t.crash/" "$work/$t" "$kept" >"$log" 2>&1; then
+      -artifact_prefix="$work/$t.crash/" "$work/$t" "$kept" >"$log" 2>&1 &
+  pid=$!
+  # libFuzzer prints the peak resident size; the current one, sampled every
+  # two seconds, shows whether the process grows: the first sample taken
+  # ten seconds in (the corpus loaded) and the last one.
+  started=$SECONDS rss0="" rss1=""
+  while kill -0 "$pid" 2>/dev/null; do
+    now=$(awk '/^VmRSS/ {print int($2 / 1024)}' "/proc/$pid/status" 2>/dev/null || true)
+    if [ -n "$now" ]; then
+      rss1="${now}Mb"
+      if [ -z "$rss0" ] && [ $((SECONDS - started)) -ge 10 ]; then rss0="$rss1"; fi
+    fi
+    sleep 2
+  done
+  if ! wait "$pid"; then
     tail -n 40 "$log"
     mkdir -p fuzz/crashes
     cp "$work/$t.crash/"* fuzz/crashes/ 2>/dev/null || true
@@ -74,10 +88,9 @@ for t in "${targets[@]}"; do
   cov=$(sed -n 's/.* cov: \([0-9]*\).*/\1/p' <<<"$last")
   ft=$(sed -n 's/.* ft: \([0-9]*\).*/\1/p' <<<"$last")
   counters=$(sed -n 's/.*Loaded [0-9]* modules *(\([0-9]*\) inline 8-bit counters).*/\1/p' "$log" | head -n 1)
-  rss0=$(grep -E '^#[0-9]+.*INITED' "$log" | sed -n 's/.* rss: \([0-9]*Mb\).*/\1/p' | head -n 1)
-  rss1=$(sed -n 's/.* rss: \([0-9]*Mb\).*/\1/p' <<<"$last")
-  summary+=("$(printf '%-16s %10s execs %7s exec/s  cov %6s of %6s  ft %7s  corpus %4s -> %4s  rss %s -> %s' \
-    "$t" "$execs" "$rate" "$cov" "$counters" "$ft" "$before" "$after" "$rss0" "$rss1")")
+  peak=$(sed -n 's/^stat::peak_rss_mb: *//p' "$log")
+  summary+=("$(printf '%-16s %10s execs %7s exec/s  cov %6s of %6s  ft %7s  corpus %4s -> %4s  rss %s -> %s (peak %sMb)' \
+    "$t" "$execs" "$rate" "$cov" "$counters" "$ft" "$before" "$after" "$rss0" "$rss1" "$peak")")
   echo "${summary[-1]}"
 done
 echo "--- ${seconds}s per target"
