@@ -51,6 +51,10 @@ void SLCGenericAgentListAppend(SLCGenericAgent* agent) {
 
 namespace {
 
+// Agents whose creation failed after they were registered and whose
+// registration could not be undone (see SLCGenericInitFastPathAgent).
+ListLinks retiredAgents = {&retiredAgents, &retiredAgents};
+
 // Copies at most size - 1 bytes of `src` and a NUL.
 void CopyText(char* dst, size_t size, const char* src) {
   size_t n = zel_Strnlen(src, size - 1);
@@ -133,12 +137,19 @@ ZelStatus SLCGenericInitFastPathAgent(char* createText) {
     SLCG_LOG_OBJ(SLCG_ATTENTION, agent->name, "Failed to register agent (%#x): %s", status,
                  zel_StatusToString(status));
     // The framework destroys whatever filters it created meanwhile.
-    if (zel_SluiceUnregisterFastPath(fp->fastPathHandle) != ZEL_OK) {
-      SLCG_LOG_OBJ(SLCG_ATTENTION, agent->name, "Failed to unregister agent");
-    }
-    fp->fastPathHandle = nullptr;
+    const ZelStatus unreg = zel_SluiceUnregisterFastPath(fp->fastPathHandle);
     DestroyAgentLock(fp);
     SLCGenericMagicKill(fp);
+    if (unreg != ZEL_OK) {
+      SLCG_LOG_OBJ(SLCG_ATTENTION, agent->name, "Failed to unregister agent (%#x): %s", unreg,
+                   zel_StatusToString(unreg));
+      // Still registered: the framework may call in with this record, so it
+      // stays allocated (its callbacks refuse the killed magic) until
+      // unload tries the unregistration again.
+      List_InsertBefore(&agent->link, &retiredAgents);
+      return status;
+    }
+    fp->fastPathHandle = nullptr;
     SLCGenericFree(agent);
     return status;
   }
@@ -209,6 +220,19 @@ ZelStatus SLCGenericAgentPropWrite(void*, void*, void*, char* data, int32_t len)
   return status;
 }
 
+void SLCGenericCleanupRetiredAgents() {
+  while (!List_IsEmpty(&retiredAgents)) {
+    SLCGenericAgent* agent = SLCGenericAgentFromLink(retiredAgents.next);
+    List_Remove(&agent->link);
+    if (ZelStatus unreg = zel_SluiceUnregisterFastPath(agent->fastPath.fastPathHandle);
+        unreg != ZEL_OK) {
+      SLCG_LOG_OBJ(SLCG_ATTENTION, agent->name, "Failed to unregister agent (%#x): %s", unreg,
+                   zel_StatusToString(unreg));
+    }
+    SLCGenericFree(agent);
+  }
+}
+
 void SLCGenericCleanupFastPathAgent(SLCGenericAgent* agent) {
   SLCGenericFastPath* fp = &agent->fastPath;
 
@@ -217,8 +241,9 @@ void SLCGenericCleanupFastPathAgent(SLCGenericAgent* agent) {
   if (fp->fastPathHandle != nullptr) {
     // Returns once the framework has destroyed our filters and unregistered
     // our slow paths through our own callbacks.
-    if (zel_SluiceUnregisterFastPath(fp->fastPathHandle) != ZEL_OK) {
-      SLCG_LOG_OBJ(SLCG_ATTENTION, agent->name, "Failed to unregister agent");
+    if (ZelStatus unreg = zel_SluiceUnregisterFastPath(fp->fastPathHandle); unreg != ZEL_OK) {
+      SLCG_LOG_OBJ(SLCG_ATTENTION, agent->name, "Failed to unregister agent (%#x): %s", unreg,
+                   zel_StatusToString(unreg));
     }
     fp->fastPathHandle = nullptr;
   }

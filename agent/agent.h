@@ -142,6 +142,9 @@ extern const ZelSluiceFastPathOps slcGenericOps;
 [[nodiscard]] ZelStatus SLCGenericInitFastPathAgent(char* createText);
 // Tears down an agent already unlinked from agentList, and frees it.
 void SLCGenericCleanupFastPathAgent(SLCGenericAgent* agent);
+// Unload: unregisters and frees the agents a failed creation could not
+// unregister.
+void SLCGenericCleanupRetiredAgents();
 // Links an agent at the end of agentList (publishing it to lock-free walks).
 void SLCGenericAgentListAppend(SLCGenericAgent* agent);
 // The next link of a lock-free walk of agentList.

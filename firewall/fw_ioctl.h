@@ -73,9 +73,10 @@ inline constexpr uint32_t FW_IOCTL_CLEAR_METHOD_END = 8;
 // A zero-filled block from the module heap, freed when it goes out of scope.
 // Sizes above 4 GiB - 1 are refused like any failed allocation, so callers
 // can compute sizes from hostile counts in 64 bits and test for null once.
+// Always inlined, so the heap records each block under the line that made it.
 class [[nodiscard]] SLCGenericHeapBlock {
  public:
-  explicit SLCGenericHeapBlock(uint64_t size)
+  [[gnu::always_inline]] explicit SLCGenericHeapBlock(uint64_t size)
       : block_(size <= UINT32_MAX ? SLCGenericAlloc(static_cast<uint32_t>(size)) : nullptr) {}
   ~SLCGenericHeapBlock() {
     if (block_ != nullptr) SLCGenericFree(block_);

@@ -157,6 +157,7 @@ void SLCGenericCleanup() {
     List_Remove(&agent->link);
     SLCGenericCleanupFastPathAgent(agent);
   }
+  SLCGenericCleanupRetiredAgents();
   if (slcGenericPortClient != nullptr) {
     zel_PGXClientPortUnregister(slcGenericPortClient);
     slcGenericPortClient = nullptr;

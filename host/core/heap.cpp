@@ -203,7 +203,7 @@ void zel_HeapDestroy(ZelHeapID heap) {
 
 void* zel_HeapAllocWithRA(ZelHeapID heap, uint32_t size, void* ra) {
   ZelHeap* h = host::Checked(heap, "zel_HeapAllocWithRA");
-  if (host::Faults::Check("zel_HeapAllocWithRA") != ZEL_OK) return nullptr;
+  if (host::Faults::Check("zel_HeapAllocWithRA", ra) != ZEL_OK) return nullptr;
   std::lock_guard<std::mutex> hg(h->mu);
   host::Checked(h, "zel_HeapAllocWithRA");   // destroyed while we waited?
   host::HeapStats& st = h->stats;

@@ -59,6 +59,15 @@ void ForgetFilterLocked(ZelSluiceFilter* f) {
   f->alive = false;
   auto& list = f->agent->filters;
   list.erase(std::remove(list.begin(), list.end(), f), list.end());
+  S().dead.push_back(f->id);
+  while (S().dead.size() > State::kDeadFiltersKept) {
+    auto it = S().filters.find(S().dead.front());
+    S().dead.pop_front();
+    if (it == S().filters.end()) continue;
+    // Packets the test never took back stay counted as live packets.
+    S().handles.erase(it->second.get());
+    S().filters.erase(it);
+  }
 }
 
 ZelStatus CopyText(const std::string& text, char* buf, uint32_t size) {
@@ -112,6 +121,7 @@ void ResetSluice() {
     S().agents.clear();
     S().deadAgents.clear();
     S().filters.clear();
+    S().dead.clear();
     S().handles.clear();
     S().nextFilter = 1;
     ResetRequestsLocked();
@@ -340,8 +350,8 @@ ZelStatus zel_SluiceGetConfigParameter(ZelSluiceFilterHandle filter, uint32_t nu
 namespace {
 
 ZelStatus TakeOver(ZelSluiceFilterHandle filter, ZelPktList* list, uint32_t direction,
-                   const char* call, bool faulted) {
-  ZelStatus injected = Faults::Check(call);
+                   const char* call, bool faulted, const void* site) {
+  ZelStatus injected = Faults::Check(call, site);
   std::vector<ZelPkt*> pkts;
   {
     std::lock_guard<std::mutex> g(S().mu);
@@ -364,12 +374,14 @@ ZelStatus TakeOver(ZelSluiceFilterHandle filter, ZelPktList* list, uint32_t dire
 
 ZelStatus zel_SluiceFaultPackets(ZelSluiceFilterHandle filter, ZelPktList* list,
                                  uint32_t direction, uint32_t /*flags*/) {
-  return TakeOver(filter, list, direction, "zel_SluiceFaultPackets", true);
+  return TakeOver(filter, list, direction, "zel_SluiceFaultPackets", true,
+                  __builtin_return_address(0));
 }
 
 ZelStatus zel_SluiceIssuePackets(ZelSluiceFilterHandle filter, ZelPktList* list,
                                  uint32_t direction) {
-  return TakeOver(filter, list, direction, "zel_SluiceIssuePackets", false);
+  return TakeOver(filter, list, direction, "zel_SluiceIssuePackets", false,
+                  __builtin_return_address(0));
 }
 
 // ---------------------------------------------------------------------------

@@ -71,7 +71,13 @@ struct State {
 
   std::vector<std::unique_ptr<ZelSluiceFastPath>> agents;   // registered, in order
   std::vector<std::unique_ptr<ZelSluiceFastPath>> deadAgents;
-  std::map<FilterId, std::unique_ptr<ZelSluiceFilter>> filters;  // alive and dead
+  // Alive filters, and the latest destroyed ones: kept so that a handle or
+  // id used after its filter was destroyed is reported as such. Only the
+  // latest kDeadFiltersKept are kept; a process that creates and destroys
+  // filters without end (a fuzzer, a long-running host) stays flat.
+  static constexpr size_t kDeadFiltersKept = 256;
+  std::map<FilterId, std::unique_ptr<ZelSluiceFilter>> filters;
+  std::deque<FilterId> dead;  // oldest first
   std::unordered_set<const ZelSluiceFilter*> handles;
   FilterId nextFilter = 1;
 

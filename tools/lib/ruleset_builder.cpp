@@ -288,7 +288,7 @@ RuleBuilder& RuleBuilder::Set(std::string_view key, std::string_view value) {
       Fail("pool name is " + std::to_string(value.size()) + " characters long; at most 127 fit");
     }
     std::memset(r.resourcePool, 0, sizeof(r.resourcePool));
-    std::memcpy(r.resourcePool, value.data(), value.size());
+    value.copy(r.resourcePool, value.size());  // `pool=` alone: no bytes, maybe no data
   } else if (key == "dot1p") {
     r.ethDot1PTag = static_cast<uint16_t>(ParseNumber(key, value, 0xffff));
   } else if (key == "dscp") {
