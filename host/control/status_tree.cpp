@@ -158,9 +158,12 @@ std::string RenderScalar(const QRY_TypeDef* type, const uint8_t* p, uint32_t siz
     return buf;
   }
   if (type->id == QRY_TYPE_CHAR_ARRAY) {
+    // A text field is a terminated string. One without a terminator is a
+    // field the handler left unwritten (it holds the output pattern) and
+    // renders as empty rather than as bytes that are not text.
     const void* nul = std::memchr(p, '\0', size);
-    size_t n = nul != nullptr ? static_cast<const uint8_t*>(nul) - p : size;
-    return std::string(reinterpret_cast<const char*>(p), n);
+    if (nul == nullptr) return std::string();
+    return std::string(reinterpret_cast<const char*>(p), static_cast<const uint8_t*>(nul) - p);
   }
   if (type->kind == QRY_KIND_ENUM) {
     if (size == 0 || size > 4) Fatal("status tree: enum %s stored in %u bytes", type->name, size);

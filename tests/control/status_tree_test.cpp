@@ -30,8 +30,8 @@ Values List(const StatusTree::Path& path, ZelStatus want = ZEL_OK) {
   return out;
 }
 
-// A leaf as the host renders it, field by field; "~" stands for a field
-// left as the host's buffer held it (0xc7 bytes).
+// A leaf as the host renders it, field by field; "~" stands for a text
+// field the module left unwritten (no terminator: rendered empty).
 Fields Render(const StatusTree::Path& path) {
   std::string text;
   EXPECT_EQ(StatusTree::Render(path, &text), ZEL_OK);
@@ -39,7 +39,7 @@ Fields Render(const StatusTree::Path& path) {
   Fields fields;
   for (std::string line; std::getline(in, line);) {
     const std::string value = line.substr(line.find(": ") + 2);
-    fields[line.substr(0, line.find(": "))] = value.starts_with('\xc7') ? "~" : value;
+    fields[line.substr(0, line.find(": "))] = value.empty() ? "~" : value;
   }
   return fields;
 }
