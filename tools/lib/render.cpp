@@ -6,6 +6,7 @@
 #include <cstring>
 
 #include "control/control.h"
+#include "tools/lib/rule_syntax.h"
 #include "tools/lib/ruleset_builder.h"
 
 namespace render {
@@ -451,6 +452,8 @@ nlohmann::json PacketJson(const PacketReport& p) {
 std::string CountersText(const CounterListing& c) {
   std::string s;
   if (!c.haveRuleset) {
+    if (!c.tallied) return fmt::format("no ruleset in force; default action {}\n",
+                                       ActionName(c.defaultAction));
     s += fmt::format("no ruleset in force; default action {}: {} packets, {} bytes\n",
                      ActionName(c.defaultAction), c.defaultPackets, c.defaultBytes);
     return s;
@@ -462,6 +465,7 @@ std::string CountersText(const CounterListing& c) {
                      r.rulesetIndex != 0 ? std::to_string(r.rulesetIndex) : "-", r.position,
                      r.exact ? "exact" : "general", r.packets, r.bytes, r.text);
   }
+  if (!c.tallied) return s;
   s += fmt::format("{:<19} {:>10} {:>12}  no rule matched: passed\n", "no match", c.noMatchPackets,
                    c.noMatchBytes);
   if (c.defaultPackets != 0) {
@@ -474,10 +478,12 @@ std::string CountersText(const CounterListing& c) {
 nlohmann::json CountersJson(const CounterListing& c) {
   nlohmann::json j;
   j["haveRuleset"] = c.haveRuleset;
-  j["defaultAction"] = {{"action", ActionName(c.defaultAction)},
-                        {"packets", c.defaultPackets},
-                        {"bytes", c.defaultBytes}};
-  j["noMatch"] = {{"packets", c.noMatchPackets}, {"bytes", c.noMatchBytes}};
+  j["defaultAction"] = {{"action", ActionName(c.defaultAction)}};
+  if (c.tallied) {
+    j["defaultAction"]["packets"] = c.defaultPackets;
+    j["defaultAction"]["bytes"] = c.defaultBytes;
+    j["noMatch"] = {{"packets", c.noMatchPackets}, {"bytes", c.noMatchBytes}};
+  }
   nlohmann::json rules = nlohmann::json::array();
   for (const RuleCounters& r : c.rules) {
     nlohmann::json e = {{"position", r.position},
@@ -491,6 +497,52 @@ nlohmann::json CountersJson(const CounterListing& c) {
   }
   j["rules"] = rules;
   return j;
+}
+
+namespace {
+
+// The action number of a text-syntax name; 0 (none) for a name not known.
+uint32_t ActionNumber(const std::string& name) {
+  for (size_t i = 0; i < rules::syntax::kActionNames.size(); i++) {
+    if (name == rules::syntax::kActionNames[i]) return static_cast<uint32_t>(i);
+  }
+  return 0;
+}
+
+}  // namespace
+
+CounterListing CountersFromJson(const nlohmann::json& j) {
+  CounterListing c;
+  if (!j.is_object()) return c;
+  auto u64 = [](const nlohmann::json& o, const char* key) -> uint64_t {
+    return o.is_object() && o.contains(key) && o[key].is_number_unsigned() ? o[key].get<uint64_t>()
+                                                                            : 0;
+  };
+  auto text = [](const nlohmann::json& o, const char* key) -> std::string {
+    return o.is_object() && o.contains(key) && o[key].is_string() ? o[key].get<std::string>() : "";
+  };
+  c.haveRuleset = j.value("haveRuleset", false);
+  const nlohmann::json def = j.value("defaultAction", nlohmann::json::object());
+  c.defaultAction = ActionNumber(text(def, "action"));
+  if (j.contains("noMatch")) {
+    c.tallied = true;
+    c.noMatchPackets = u64(j["noMatch"], "packets");
+    c.noMatchBytes = u64(j["noMatch"], "bytes");
+    c.defaultPackets = u64(def, "packets");
+    c.defaultBytes = u64(def, "bytes");
+  }
+  for (const nlohmann::json& e : j.value("rules", nlohmann::json::array())) {
+    RuleCounters r;
+    r.position = static_cast<uint32_t>(u64(e, "position"));
+    r.rulesetIndex = u64(e, "rulesetIndex");
+    r.exact = text(e, "table") == "exact";
+    r.action = ActionNumber(text(e, "action"));
+    r.text = text(e, "summary");
+    r.packets = u64(e, "packets");
+    r.bytes = u64(e, "bytes");
+    c.rules.push_back(std::move(r));
+  }
+  return c;
 }
 
 std::string LogText(std::span<const LogLine> lines) {

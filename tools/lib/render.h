@@ -121,14 +121,19 @@ struct CounterListing {
   bool haveRuleset = false;
   uint32_t defaultAction = 0;
   std::vector<RuleCounters> rules;   // in ruleset order
-  // Tallied from the traces: packets the default action decided (no
-  // ruleset in force) and packets that no rule matched.
+  // Tallied from the traces of a run (`tallied`): packets the default
+  // action decided (no ruleset in force) and packets that no rule matched.
+  // A live filter has no such counters, and its listing leaves them out.
+  bool tallied = false;
   uint64_t defaultPackets = 0, defaultBytes = 0;
   uint64_t noMatchPackets = 0, noMatchBytes = 0;
 };
 
 std::string CountersText(const CounterListing& c);
 nlohmann::json CountersJson(const CounterListing& c);
+// The listing back from CountersJson's document (as a client receives it);
+// missing or mistyped fields are left at their defaults.
+CounterListing CountersFromJson(const nlohmann::json& j);
 
 // --- Module log ------------------------------------------------------------------
 

@@ -10,6 +10,7 @@
 #include "host/net/packets.h"
 #include "host/sluice/framework.h"
 #include "module/module.h"
+#include "tools/lib/filter_view.h"
 #include "tools/lib/ruleset_builder.h"
 
 namespace runner {
@@ -30,136 +31,6 @@ std::vector<render::ByteChange> Diff(const Bytes& before, const Bytes& after) {
     if (before[i] != after[i]) out.push_back({i, before[i], after[i]});
   }
   return out;
-}
-
-// The status tree's view of the filter: its instance name and rule
-// summaries, position by position.
-struct TreeView {
-  std::string instance;
-  std::vector<SLCGeneric_RuleSummary> rules;
-  SLCGeneric_RuleSetSummary summary{};
-  bool haveSummary = false;
-};
-
-TreeView ReadTree(const std::string& agent) {
-  TreeView v;
-  std::vector<host::QryValue> filters;
-  if (host::StatusTree::List({"agents", agent, "filters"}, &filters) != ZEL_OK ||
-      filters.empty() || !std::holds_alternative<std::string>(filters[0])) {
-    return v;
-  }
-  v.instance = std::get<std::string>(filters[0]);
-  const host::StatusTree::Path base = {"agents", agent, "filters", v.instance};
-  std::vector<uint8_t> bytes;
-  auto path = [&](std::initializer_list<host::QryValue> rest) {
-    host::StatusTree::Path p = base;
-    p.insert(p.end(), rest);
-    return p;
-  };
-  if (host::StatusTree::Get(path({"ruleSetSummary"}), &bytes) == ZEL_OK &&
-      bytes.size() >= sizeof(v.summary)) {
-    std::memcpy(&v.summary, bytes.data(), sizeof(v.summary));
-    v.haveSummary = true;
-  }
-  std::vector<host::QryValue> positions;
-  if (host::StatusTree::List(path({"rules"}), &positions) != ZEL_OK) return v;
-  for (const host::QryValue& pos : positions) {
-    if (!std::holds_alternative<int64_t>(pos)) continue;
-    SLCGeneric_RuleSummary r;
-    std::memset(&r, 0, sizeof(r));
-    if (host::StatusTree::Get(path({"rules", pos, "ruleSummary"}), &bytes) == ZEL_OK &&
-        bytes.size() >= sizeof(r)) {
-      std::memcpy(&r, bytes.data(), sizeof(r));
-    }
-    v.rules.push_back(r);
-  }
-  return v;
-}
-
-// The ruleset in force through the agent's character device (get request),
-// records in the module's positions; empty when the device refuses.
-std::vector<FWRule> ReadRulesByDevice(const std::string& agent, const std::string& filterName,
-                                      uint32_t numRules) {
-  const size_t need = FW_RULESET_HEADER_SIZE + static_cast<size_t>(numRules) * FW_RULE_SIZE_V8;
-  Bytes request(std::max(need, sizeof(FWCharDevRequest)), 0);
-  const uint32_t type = FWCharDevReqGetRuleset;
-  std::memcpy(request.data(), &type, 4);
-  std::memcpy(request.data() + offsetof(FWCharDevRequest, filterName), filterName.data(),
-              std::min(filterName.size(), sizeof(FWCharDevRequest::filterName) - 1));
-  const uint64_t addr = host::UserMemory::Map(request);
-  int32_t result = 0;
-  const ZelStatus s = host::CharDevs::Ioctl(agent, 0, addr, &result);
-  Bytes reply = host::UserMemory::Read(addr, need);
-  host::UserMemory::Unmap(addr);
-  if (s != ZEL_OK || reply.size() < FW_RULESET_HEADER_SIZE) return {};
-  uint64_t size = 0;
-  uint32_t written = 0;
-  std::memcpy(&written, reply.data() + offsetof(FWRulesetHeader, numRules), 4);
-  if (FWGetRuleSize(reply[0], &size) != ZEL_OK || written > numRules) return {};
-  reply.resize(FW_RULESET_HEADER_SIZE + written * size);
-  std::vector<uint8_t> trimmed(reply.begin(), reply.end());
-  try {
-    return rules::DecodeRuleset(trimmed).rules;
-  } catch (const rules::RuleError&) {
-    return {};
-  }
-}
-
-// Equal records apart from their counters.
-bool SameRuleIgnoringCounters(const FWRule& a, const FWRule& b) {
-  constexpr size_t kCounters = offsetof(FWRule, pktCount);
-  constexpr size_t kAfter = offsetof(FWRule, byteCount) + sizeof(uint64_t);
-  const auto* pa = reinterpret_cast<const uint8_t*>(&a);
-  const auto* pb = reinterpret_cast<const uint8_t*>(&b);
-  return std::memcmp(pa, pb, kCounters) == 0 &&
-         std::memcmp(pa + kAfter, pb + kAfter, sizeof(FWRule) - kAfter) == 0;
-}
-
-uint64_t FieldNumber(const char* field, size_t size) {
-  const std::string text(field, strnlen(field, size));
-  return std::strtoull(text.c_str(), nullptr, 10);
-}
-
-render::CounterListing ReadCounters(const Config& config, const std::string& agent) {
-  render::CounterListing c;
-  const TreeView tree = ReadTree(agent);
-  if (tree.haveSummary) std::memcpy(&c.defaultAction, &tree.summary.defaultAction, 4);
-  if (config.ruleset.empty()) return c;
-  c.haveRuleset = true;
-  const std::vector<FWRule> installed =
-      ReadRulesByDevice(agent, config.filterName, static_cast<uint32_t>(tree.rules.size()));
-  std::vector<FWRule> given;
-  try {
-    given = rules::DecodeRuleset(config.ruleset).rules;
-  } catch (const rules::RuleError&) {
-  }
-  std::vector<bool> used(given.size(), false);
-  for (size_t pos = 0; pos < tree.rules.size(); pos++) {
-    const SLCGeneric_RuleSummary& s = tree.rules[pos];
-    render::RuleCounters r;
-    r.position = static_cast<uint32_t>(pos);
-    std::memcpy(&r.action, &s.action, 4);
-    r.text = render::RuleSummaryLine(s);
-    r.packets = FieldNumber(s.pktCount, sizeof(s.pktCount));
-    r.bytes = FieldNumber(s.byteCount, sizeof(s.byteCount));
-    if (pos < installed.size()) {
-      r.exact = rules::IsExactRule(installed[pos]);
-      for (size_t i = 0; i < given.size(); i++) {
-        if (!used[i] && SameRuleIgnoringCounters(given[i], installed[pos])) {
-          used[i] = true;
-          r.rulesetIndex = i + 1;
-          break;
-        }
-      }
-    }
-    c.rules.push_back(r);
-  }
-  std::stable_sort(c.rules.begin(), c.rules.end(), [](const auto& a, const auto& b) {
-    const size_t ia = a.rulesetIndex == 0 ? SIZE_MAX : a.rulesetIndex;
-    const size_t ib = b.rulesetIndex == 0 ? SIZE_MAX : b.rulesetIndex;
-    return ia < ib;
-  });
-  return c;
 }
 
 CaptureRecord Out(const CaptureRecord& in, Bytes frame) {
@@ -260,7 +131,9 @@ Result Run(const Config& config) {
 
   auto* module = static_cast<SLCGenericFilter*>(host::Sluice::FilterPriv(filter));
   std::vector<std::string> ruleTexts;
-  for (const SLCGeneric_RuleSummary& r : ReadTree(agent).rules) {
+  const std::vector<std::string> instances = filterview::FilterInstances(agent);
+  const std::string instance = instances.empty() ? std::string() : instances[0];
+  for (const SLCGeneric_RuleSummary& r : filterview::RuleSummaries(agent, instance)) {
     ruleTexts.push_back(render::RuleSummaryLine(r));
   }
   uint16_t greId = 0;
@@ -359,7 +232,8 @@ Result Run(const Config& config) {
     result.packets.push_back(std::move(p));
   }
 
-  result.counters = ReadCounters(config, agent);
+  result.counters = filterview::ReadCounters(agent, instance, config.ruleset);
+  result.counters.tallied = true;
   result.counters.noMatchPackets = tallies.noMatchPackets;
   result.counters.noMatchBytes = tallies.noMatchBytes;
   result.counters.defaultPackets = tallies.defaultPackets;
