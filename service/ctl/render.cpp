@@ -2,30 +2,12 @@
 
 #include <fmt/format.h>
 
+#include "tools/lib/render.h"
+
 namespace ctl {
 namespace {
 
 std::string Str(const nlohmann::json& j) { return j.is_string() ? j.get<std::string>() : j.dump(); }
-
-// The fields of a rule summary worth a column when not a wildcard.
-constexpr const char* kMatchFields[] = {"dMac", "sMac",    "ethType", "vlan1QTag", "ipSa",
-                                        "ipDa", "ipProto", "sPort",   "dPort"};
-
-// "SLCGenericActionDrop (drop packets)" -> "Drop".
-std::string Short(const nlohmann::json& j, const std::string& prefix) {
-  std::string s = Str(j);
-  if (s.rfind(prefix, 0) == 0) s = s.substr(prefix.size());
-  return s.substr(0, s.find(' '));
-}
-
-// Only printable text; the module leaves fields of unused actions unset.
-bool Printable(const std::string& s) {
-  if (s.empty()) return false;
-  for (unsigned char ch : s) {
-    if (ch < 0x20 || ch > 0x7e) return false;
-  }
-  return true;
-}
 
 }  // namespace
 
@@ -40,30 +22,14 @@ std::string RenderStatus(const nlohmann::json& tree) {
           out += fmt::format("    {}: {}\n", k, Str(v));
         }
       }
-      const auto rules = f.value("rules", nlohmann::json::array());
-      if (!rules.empty()) {
-        out += fmt::format("    {:>5} {:<12} {:<6} {:>12} {:>14}  match\n", "rule", "action", "dir",
-                           "packets", "bytes");
-      }
-      for (const auto& r : rules) {
-        std::string match;
-        for (const char* field : kMatchFields) {
-          if (!r.contains(field)) continue;
-          const std::string v = Str(r[field]);
-          if (v.empty() || v == "*" || v == "any") continue;
-          match += fmt::format("{}={} ", field, v);
+      if (f.contains("counters")) {
+        std::string listing = render::CountersText(render::CountersFromJson(f["counters"]));
+        for (size_t at = 0; at < listing.size();) {
+          const size_t end = listing.find('\n', at);
+          out += "    " + listing.substr(at, end == std::string::npos ? end : end + 1 - at);
+          if (end == std::string::npos) break;
+          at = end + 1;
         }
-        for (const char* extra : {"greIP", "rewriteMac", "dscpTag", "ethDot1PTag"}) {
-          if (r.contains(extra) && Printable(Str(r[extra])) && Str(r[extra]) != "*") {
-            match += fmt::format("{}={} ", extra, Str(r[extra]));
-          }
-        }
-        out += fmt::format("    {:>5} {:<12} {:<6} {:>12} {:>14}  {}\n",
-                           Str(r.value("rule", nlohmann::json(""))),
-                           Short(r.value("action", nlohmann::json("")), "SLCGenericAction"),
-                           Short(r.value("direction", nlohmann::json("")), "SLCGenericDirection"),
-                           Str(r.value("pktCount", nlohmann::json(""))),
-                           Str(r.value("byteCount", nlohmann::json(""))), match);
       }
       if (f.contains("rulesOmitted")) {
         out += fmt::format("    ... {} more rules (--max-rules)\n", Str(f["rulesOmitted"]));

@@ -16,6 +16,8 @@
 #include "host/net/packets.h"
 #include "host/sluice/framework.h"
 #include "module/module.h"
+#include "tools/lib/filter_view.h"
+#include "tools/lib/render.h"
 
 namespace service {
 namespace {
@@ -423,24 +425,12 @@ Message ControlServer::Status(const Message& req) {
           ZEL_OK) {
         fj["ruleSetSummary"] = LeafToJson(text);
       }
-      nlohmann::json rules = nlohmann::json::array();
-      std::vector<host::QryValue> ruleIds;
-      if (host::StatusTree::List({"agents", a, "filters", f, "rules"}, &ruleIds) == ZEL_OK) {
-        int64_t shown = 0;
-        for (const auto& r : ruleIds) {
-          if (shown++ >= maxRules) {
-            fj["rulesOmitted"] = static_cast<int64_t>(ruleIds.size()) - maxRules;
-            break;
-          }
-          if (host::StatusTree::Render({"agents", a, "filters", f, "rules", r, "ruleSummary"},
-                                       &text) == ZEL_OK) {
-            nlohmann::json rj = LeafToJson(text);
-            rj["rule"] = QryString(r);
-            rules.push_back(std::move(rj));
-          }
-        }
-      }
-      fj["rules"] = std::move(rules);
+      // Rules and counters as every tool lists them (tools/lib/render.h).
+      size_t omitted = 0;
+      const render::CounterListing listing = filterview::ReadCounters(
+          agentName, QryString(f), {}, static_cast<size_t>(maxRules), &omitted);
+      fj["counters"] = render::CountersJson(listing);
+      if (omitted != 0) fj["rulesOmitted"] = omitted;
       agentJson["filters"].push_back(std::move(fj));
     }
     tree.push_back(std::move(agentJson));

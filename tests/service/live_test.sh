@@ -65,8 +65,8 @@ rule_packets() {  # rule_packets INDEX: packet counter of rule INDEX
   ctl --json status --agent fw | python3 -c '
 import json, sys
 t = json.load(sys.stdin)
-rules = t["agents"][0]["filters"][0]["rules"]
-print(next(r["pktCount"] for r in rules if r["rule"] == sys.argv[1]))' "$1"
+rules = t["agents"][0]["filters"][0]["counters"]["rules"]
+print(next(r["packets"] for r in rules if r["position"] == int(sys.argv[1])))' "$1"
 }
 
 topo_up "$P" || { echo "FAIL could not make namespaces"; exit 1; }

@@ -21,7 +21,8 @@ struct TreeView {
   bool haveSummary = false;
 };
 
-TreeView ReadTree(const std::string& agent, const std::string& instance) {
+TreeView ReadTree(const std::string& agent, const std::string& instance,
+                  size_t maxRules = SIZE_MAX, size_t* omitted = nullptr) {
   TreeView v;
   const host::StatusTree::Path base = {"agents", agent, "filters", instance};
   std::vector<uint8_t> bytes;
@@ -37,6 +38,8 @@ TreeView ReadTree(const std::string& agent, const std::string& instance) {
   }
   std::vector<host::QryValue> positions;
   if (host::StatusTree::List(path({"rules"}), &positions) != ZEL_OK) return v;
+  if (omitted != nullptr) *omitted = positions.size() > maxRules ? positions.size() - maxRules : 0;
+  if (positions.size() > maxRules) positions.resize(maxRules);
   for (const host::QryValue& pos : positions) {
     if (!std::holds_alternative<int64_t>(pos)) continue;
     SLCGeneric_RuleSummary r;
@@ -117,9 +120,10 @@ std::vector<SLCGeneric_RuleSummary> RuleSummaries(const std::string& agent,
 }
 
 render::CounterListing ReadCounters(const std::string& agent, const std::string& instance,
-                                    std::span<const uint8_t> givenBytes) {
+                                    std::span<const uint8_t> givenBytes, size_t maxRules,
+                                    size_t* omitted) {
   render::CounterListing c;
-  const TreeView tree = ReadTree(agent, instance);
+  const TreeView tree = ReadTree(agent, instance, maxRules, omitted);
   if (tree.haveSummary) std::memcpy(&c.defaultAction, &tree.summary.defaultAction, 4);
   if (givenBytes.empty() && tree.rules.empty()) return c;
   c.haveRuleset = true;

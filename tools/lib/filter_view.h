@@ -31,8 +31,10 @@ std::vector<SLCGeneric_RuleSummary> RuleSummaries(const std::string& agent,
 // wire ruleset that was installed; rules not found in it, such as mirrors,
 // follow in module order). With `given` empty, module order. The listing's
 // tallies (no match, default action) are left at zero and untallied: the
-// module keeps no counters for them.
+// module keeps no counters for them. At most `maxRules` rules are read (the
+// first ones in module order); `*omitted`, when given, gets the number left.
 render::CounterListing ReadCounters(const std::string& agent, const std::string& instance,
-                                    std::span<const uint8_t> given);
+                                    std::span<const uint8_t> given,
+                                    size_t maxRules = SIZE_MAX, size_t* omitted = nullptr);
 
 }  // namespace filterview
