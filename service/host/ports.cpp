@@ -152,7 +152,7 @@ bool PortSpecFromJson(const nlohmann::json& j, PortSpec* out, std::string* error
   return true;
 }
 
-std::unique_ptr<Port> Port::Open(const PortSpec& spec, std::string* error) {
+std::unique_ptr<Port> Port::Open(const PortSpec& spec, std::string* error, bool start) {
   std::unique_ptr<Port> port(new Port);
   port->spec_ = spec;
   port->fd_[1] = OpenInterface(spec.switchIf, error);
@@ -177,16 +177,37 @@ std::unique_ptr<Port> Port::Open(const PortSpec& spec, std::string* error) {
     port->filter_ = 0;
     return nullptr;
   }
-  port->readers_[1] = std::thread([p = port.get()] { p->Reader(1); });
-  port->readers_[2] = std::thread([p = port.get()] { p->Reader(2); });
+  if (start) port->StartReaders();
   return port;
 }
 
-bool Port::Close(int waitMs) {
+void Port::StartReaders() {
+  StopReaders();
+  stop_ = false;
+  readers_[1] = std::thread([this] { Reader(1); });
+  readers_[2] = std::thread([this] { Reader(2); });
+}
+
+void Port::StopReaders() {
   stop_ = true;
   for (int side : {1, 2}) {
     if (readers_[side].joinable()) readers_[side].join();
   }
+}
+
+size_t Port::FromSlowPath(const std::vector<std::vector<uint8_t>>& frames, uint32_t direction) {
+  host::PacketList list;
+  for (const auto& f : frames) list.Append(host::Packets::Make(f));
+  (void)host::Sluice::DeliverFromSlowPath(filter_, list, direction);
+  // What the callback left in the list continues the way it was going.
+  Transmit(fd_[direction == 1 ? 2 : 1], list, direction);
+  if (host::Sluice::IssuedCount(filter_) > 0) TransmitDeliveries(host::Sluice::TakeIssued(filter_));
+  counters_.fromSlowPath += frames.size();
+  return frames.size();
+}
+
+bool Port::Close(int waitMs) {
+  StopReaders();
   if (filter_ == 0) return true;
   const auto deadline = std::chrono::steady_clock::now() + std::chrono::milliseconds(waitMs);
   for (;;) {
@@ -219,6 +240,7 @@ nlohmann::json Port::Stats() const {
   return {{"rxFromSwitch", c.rx[1].load()}, {"rxFromVm", c.rx[2].load()},
           {"txToVm", c.tx[1].load()},       {"txToSwitch", c.tx[2].load()},
           {"turnedBack", c.turnedBack.load()}, {"slowPath", c.slowPath.load()},
+          {"fromSlowPath", c.fromSlowPath.load()},
           {"oversize", c.oversize.load()},  {"txErrors", c.txErrors.load()},
           {"batches", c.batches.load()}, {"busyNs", c.busyNs.load()},
           {"moduleNs", c.moduleNs.load()}};
@@ -266,13 +288,13 @@ void Port::Transmit(int fd, host::PacketList& list, uint32_t direction) {
   }
 }
 
-void Port::TransmitDeliveries(int fd, std::vector<host::Delivery> deliveries,
-                              uint32_t direction) {
+void Port::TransmitDeliveries(std::vector<host::Delivery> deliveries) {
   for (auto& d : deliveries) {
-    counters_.turnedBack += d.packets.size();
+    const uint32_t direction = d.direction == 1 ? 1 : 2;
+    if (direction == 2) counters_.turnedBack += d.packets.size();
     host::PacketList list;
     for (ZelPkt* p : d.packets) list.Append(p);
-    Transmit(fd, list, direction);
+    Transmit(fd_[direction == 1 ? 2 : 1], list, direction);
   }
 }
 
@@ -315,7 +337,7 @@ void Port::Reader(int side) {
         std::chrono::duration_cast<std::chrono::nanoseconds>(t2 - t1).count());
     Transmit(outFd, list, direction);
     if (host::Sluice::IssuedCount(filter_) > 0) {
-      TransmitDeliveries(fd_[1], host::Sluice::TakeIssued(filter_), 2);
+      TransmitDeliveries(host::Sluice::TakeIssued(filter_));
     }
     if (host::Sluice::FaultedCount(filter_) > 0) {
       for (auto& d : host::Sluice::TakeFaulted(filter_)) {
