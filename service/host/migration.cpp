@@ -7,6 +7,7 @@
 // lets traffic in. The source removes its port once the destination has
 // taken the filter; if anything fails before that, the source port resumes
 // as it was.
+#include <cstdio>
 #include <cstring>
 #include <thread>
 
@@ -40,7 +41,9 @@ uint64_t HeaderField(const std::vector<uint8_t>& state, size_t at) {
 Message Fail(const std::string& why) { return slcproto::Reply(false, why); }
 
 Message FailStatus(const std::string& what, ZelStatus st) {
-  Message m = Fail(what + ": " + zel_StatusToString(st));
+  char code[16];
+  std::snprintf(code, sizeof code, "%#x", st);
+  Message m = Fail(what + ": " + code + " " + zel_StatusToString(st));
   m.args["status"] = st;
   return m;
 }
