@@ -55,28 +55,31 @@ start_host() {
   HOST_PID=$!
   for _ in $(seq 50); do "$CTL" --socket "$SOCK" hello >/dev/null 2>&1 && break; sleep 0.1; done
 }
+# The share of the port's busy time spent in the filter, and busy and
+# filter nanoseconds per frame read from the VM side.
 share() {
   "$CTL" --socket "$SOCK" --json stats | python3 -c '
 import json, sys
 t = json.load(sys.stdin)["ports"][0]["traffic"]
-busy, mod = t["busyNs"], t["moduleNs"]
-print("%.0f%%" % (100.0 * mod / busy) if busy else "-")'
+busy, mod, n = t["busyNs"], t["moduleNs"], max(1, t["rxFromVm"])
+print("%.1f%% %d %d %.1f" % (100.0 * mod / max(1, busy), busy / n, mod / n, n / max(1, t["batches"])))'
 }
-report() { printf '%-28s %12s %12s %8s\n' "$@"; }
+report() { printf '%-28s %10s %12s %7s %8s %8s %6s\n' "$@"; }
 
-report "case" "sent/s" "delivered/s" "module"
+report "case" "sent/s" "delivered/s" "filter" "busy ns" "filt ns" "batch"
 # Kernel bridge between the two sides: what the veth pairs carry unfiltered.
 ip -n "$P-fp" link add br0 type bridge
 ip -n "$P-fp" link set vmside master br0
 ip -n "$P-fp" link set swside master br0
 ip -n "$P-fp" link set br0 up
 read -r s d < <(blast)
-report "kernel bridge (no filter)" "$s" "$d" "-"
+report "kernel bridge (no filter)" "$s" "$d" "-" "-" "-" "-"
 ip -n "$P-fp" link del br0
 
 start_host
 read -r s d < <(blast)
-report "sluice-host, no rules" "$s" "$d" "$(share)"
+read -r sh busy mod batch < <(share)
+report "sluice-host, no rules" "$s" "$d" "$sh" "$busy" "$mod" "$batch"
 stop_host
 
 {
@@ -88,7 +91,8 @@ stop_host
 start_host
 "$CTL" --socket "$SOCK" ruleset set vm1.eth0 "$DIR/exact.rules" >/dev/null
 read -r s d < <(blast)
-report "sluice-host, 1000 exact" "$s" "$d" "$(share)"
+read -r sh busy mod batch < <(share)
+report "sluice-host, 1000 exact" "$s" "$d" "$sh" "$busy" "$mod" "$batch"
 stop_host
 
 {
@@ -101,5 +105,6 @@ stop_host
 start_host
 "$CTL" --socket "$SOCK" ruleset set vm1.eth0 "$DIR/general.rules" >/dev/null
 read -r s d < <(blast)
-report "sluice-host, 1000 general" "$s" "$d" "$(share)"
+read -r sh busy mod batch < <(share)
+report "sluice-host, 1000 general" "$s" "$d" "$sh" "$busy" "$mod" "$batch"
 stop_host

@@ -110,6 +110,7 @@ int main(int argc, char** argv) {
   app.add_option("--timeout-ms", c.timeoutMs, "give up on a reply after this long")
       ->capture_default_str();
   app.require_subcommand(1);
+  app.fallthrough();  // --json and --socket may also follow the subcommand
 
   Message req;
   std::string file, wireOut, agentArg, filterArg, uuidArg;
