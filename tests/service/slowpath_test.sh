@@ -157,6 +157,8 @@ check "the slow path's capture holds them" \
 sp_cmd a1 "rules vm1"
 check "rules read back over the filter-ioctl channel" wait_for "$DIR/a1.out" "rules vm1 rules=3"
 check "rule counters equal what was sent" test "$(rule_counts A)" = "4 3 5"
+stats_show_link() { ctl A stats | grep -q "slow path #1 a1 (agent fw): filters \[vm1\], punted 5 (dropped 0), sent back 5"; }
+check "stats show the link and what passed over it" stats_show_link
 
 # --- killing the slow path mid-stream loses nothing the rules accept -----------
 recv_udp "$P-net" 5200 "$DIR/k5200"; K1=$LAST_RECV
