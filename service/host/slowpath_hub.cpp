@@ -64,7 +64,7 @@ void SlowPathHub::Shutdown() {
     std::lock_guard<std::mutex> g(mu_);
     for (auto& [id, link] : links_) {
       // The reader sees the end of the stream and tears the link down.
-      if (!link->finished) ::shutdown(link->fd, SHUT_RDWR);
+      if (link->fd >= 0) ::shutdown(link->fd, SHUT_RDWR);
       links.push_back(link);
     }
   }
@@ -134,7 +134,9 @@ void SlowPathHub::Adopt(int fd, const Message& reg) {
     }
     link->qcv.notify_all();
     link->writer.join();
+    std::lock_guard<std::mutex> g(mu_);
     close(fd);
+    link->fd = -1;
     link->finished = true;
     return;
   }
@@ -285,7 +287,12 @@ void SlowPathHub::Teardown(const std::shared_ptr<Link>& link) {
   }
   link->qcv.notify_all();
   if (link->writer.joinable()) link->writer.join();
-  close(link->fd);
+  {
+    // Under the lock: Shutdown must not shut down a number reused since.
+    std::lock_guard<std::mutex> g(mu_);
+    close(link->fd);
+    link->fd = -1;
+  }
   std::fprintf(stderr, "sluice-host: slow path #%u (%s) of %s went away\n", link->id,
                link->name.c_str(), link->agent.c_str());
   link->finished = true;

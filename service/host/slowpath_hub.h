@@ -91,7 +91,7 @@ class SlowPathHub : public host::SlowPathBackend {
   struct Link {
     uint32_t id = 0;
     std::string agent, name;
-    int fd = -1;
+    int fd = -1;                          // closed (-1) under the hub's mu_
     std::thread reader, writer;
     std::atomic<bool> finished{false};   // reader done, link torn down
 
