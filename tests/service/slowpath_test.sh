@@ -178,12 +178,18 @@ check "host survives and unregistered the slow path" test "$(slowpaths_of A)" = 
 check "host log says the slow path went away" grep -q "went away" "$DIR/A.log"
 start_sp a2 A --reissue
 check "a new slow path gets the filter" wait_for "$DIR/a2.out" "attached vm1"
+sp_cmd a2 "clear vm1"
+sp_cmd a2 "rules vm1"
+check "rules cleared over the filter-ioctl channel" wait_for "$DIR/a2.out" "rules vm1 rules=0"
+sp_cmd a2 "push vm1 $DIR/rules.txt"
+check "and pushed again" wait_for "$DIR/a2.out" "push vm1 status=1"
 check "verdicts unchanged with the new slow path" test "$(traffic_round "$P")" = "4 0 5"
 
 # --- migration A -> B: verdicts, counters and slow path state -----------------
 start_sp b1 B --reissue
 check "destination slow path registers" wait_for "$DIR/b1.out" "registered"
 BEFORE=$(rule_counts A)
+check "counters started over with the pushed rules" test "$BEFORE" = "4 3 5"
 sp_cmd a2 counts
 wait_for "$DIR/a2.out" "counts-end"
 SP_BEFORE=$(sed -n 's/^counts vm1 .*to-switch=\([0-9]*\) .*/\1/p' "$DIR/a2.out" | tail -1)
