@@ -104,20 +104,44 @@ print(" ".join(s["name"] + ":" + ",".join(s["filters"]) for s in json.load(sys.s
 heap_of() {
   ctl "$1" --json stats | python3 -c 'import json,sys; print(json.load(sys.stdin)["heapBytes"])'
 }
-# One round of traffic from the VM in namespace prefix PFX: 4 accepted,
-# 3 dropped, 5 punted (sent back by the slow path). Prints what arrived.
+# One round of traffic from the VM in namespace prefix PFX: 4 datagrams to
+# an accepted port, 3 to a dropped one, 5 to a punted one (sent back by the
+# slow path), then a marker; the receiver stops shortly after the marker and
+# prints what arrived on each port.
 traffic_round() {  # traffic_round PFX
-  local pfx=$1 r1 r2 r3
-  recv_udp "$pfx-net" 5200 "$DIR/r5200"; r1=$LAST_RECV
-  recv_udp "$pfx-net" 5400 "$DIR/r5400"; r2=$LAST_RECV
-  recv_udp "$pfx-net" 5300 "$DIR/r5300"; r3=$LAST_RECV
-  sleep 0.3
-  send_udp "$pfx-vm" 10.77.0.2 5200 4
-  send_udp "$pfx-vm" 10.77.0.2 5400 3
-  send_udp "$pfx-vm" 10.77.0.2 5300 5
-  sleep 0.7
-  kill $r1 $r2 $r3 2>/dev/null; wait $r1 $r2 $r3 2>/dev/null
-  echo "$(lines "$DIR/r5200") $(lines "$DIR/r5400") $(lines "$DIR/r5300")"
+  local pfx=$1 r
+  rm -f "$DIR/ready"
+  ip netns exec "$pfx-net" timeout 15 python3 -c '
+import select, socket, sys, time
+socks = {}
+for port in (5200, 5400, 5300, 5999):
+    s = socket.socket(socket.AF_INET, socket.SOCK_DGRAM)
+    s.bind(("0.0.0.0", port))
+    socks[s] = port
+open(sys.argv[1], "w").close()
+got = {5200: 0, 5400: 0, 5300: 0}
+end = time.time() + 10
+while time.time() < end:
+    ready, _, _ = select.select(list(socks), [], [], 0.05)
+    for s in ready:
+        s.recv(2048)
+        port = socks[s]
+        if port == 5999:
+            end = min(end, time.time() + 0.5)
+        else:
+            got[port] += 1
+print(got[5200], got[5400], got[5300])' "$DIR/ready" >"$DIR/round" &
+  r=$!
+  for _ in $(seq 100); do [ -e "$DIR/ready" ] && break; sleep 0.05; done
+  ip netns exec "$pfx-vm" python3 -c '
+import socket, time
+s = socket.socket(socket.AF_INET, socket.SOCK_DGRAM)
+for port, n in ((5200, 4), (5400, 3), (5300, 5), (5999, 1)):
+    for i in range(n):
+        s.sendto(b"d%d\n" % i, ("10.77.0.2", port))
+        time.sleep(0.002)'
+  wait $r
+  cat "$DIR/round"
 }
 
 cat >"$DIR/rules.txt" <<'EOF'
@@ -168,8 +192,7 @@ S1=$!
 ( send_udp "$P-vm" 10.77.0.2 5300 300 0.004 ) &
 S2=$!
 sleep 0.5
-kill -KILL "$SP_a1"
-wait "$SP_a1" 2>/dev/null
+{ kill -KILL "$SP_a1"; wait "$SP_a1"; } 2>/dev/null
 wait $S1 $S2
 sleep 0.5
 kill $K1 2>/dev/null; wait $K1 2>/dev/null
