@@ -62,24 +62,25 @@ share() {
 import json, sys
 t = json.load(sys.stdin)["ports"][0]["traffic"]
 busy, mod, n = t["busyNs"], t["moduleNs"], max(1, t["rxFromVm"])
-print("%.1f%% %d %d %.1f" % (100.0 * mod / max(1, busy), busy / n, mod / n, n / max(1, t["batches"])))'
+print("%.1f%% %d %d %d %.1f" % (100.0 * mod / max(1, busy), busy / n, mod / n, t["txNs"] / n,
+                              n / max(1, t["batches"])))'
 }
-report() { printf '%-28s %10s %12s %7s %8s %8s %6s\n' "$@"; }
+report() { printf '%-28s %10s %12s %7s %8s %8s %8s %6s\n' "$@"; }
 
-report "case" "sent/s" "delivered/s" "filter" "busy ns" "filt ns" "batch"
+report "case" "sent/s" "delivered/s" "filter" "busy ns" "filt ns" "send ns" "batch"
 # Kernel bridge between the two sides: what the veth pairs carry unfiltered.
 ip -n "$P-fp" link add br0 type bridge
 ip -n "$P-fp" link set vmside master br0
 ip -n "$P-fp" link set swside master br0
 ip -n "$P-fp" link set br0 up
 read -r s d < <(blast)
-report "kernel bridge (no filter)" "$s" "$d" "-" "-" "-" "-"
+report "kernel bridge (no filter)" "$s" "$d" "-" "-" "-" "-" "-"
 ip -n "$P-fp" link del br0
 
 start_host
 read -r s d < <(blast)
-read -r sh busy mod batch < <(share)
-report "sluice-host, no rules" "$s" "$d" "$sh" "$busy" "$mod" "$batch"
+read -r sh busy mod tx batch < <(share)
+report "sluice-host, no rules" "$s" "$d" "$sh" "$busy" "$mod" "$tx" "$batch"
 stop_host
 
 {
@@ -91,8 +92,8 @@ stop_host
 start_host
 "$CTL" --socket "$SOCK" ruleset set vm1.eth0 "$DIR/exact.rules" >/dev/null
 read -r s d < <(blast)
-read -r sh busy mod batch < <(share)
-report "sluice-host, 1000 exact" "$s" "$d" "$sh" "$busy" "$mod" "$batch"
+read -r sh busy mod tx batch < <(share)
+report "sluice-host, 1000 exact" "$s" "$d" "$sh" "$busy" "$mod" "$tx" "$batch"
 stop_host
 
 {
@@ -105,6 +106,6 @@ stop_host
 start_host
 "$CTL" --socket "$SOCK" ruleset set vm1.eth0 "$DIR/general.rules" >/dev/null
 read -r s d < <(blast)
-read -r sh busy mod batch < <(share)
-report "sluice-host, 1000 general" "$s" "$d" "$sh" "$busy" "$mod" "$batch"
+read -r sh busy mod tx batch < <(share)
+report "sluice-host, 1000 general" "$s" "$d" "$sh" "$busy" "$mod" "$tx" "$batch"
 stop_host

@@ -65,7 +65,7 @@ echo "== traffic"
 nsx vm ping -c 3 -i 0.2 -W 1 -q 10.77.0.2 >/dev/null && echo "ping: answered" || echo "ping: dropped"
 nsx net timeout 3 socat -u TCP-LISTEN:8080,reuseaddr - >"$DIR/web" 2>/dev/null &
 nsx net timeout 3 socat -u TCP-LISTEN:23,reuseaddr - >"$DIR/telnet" 2>/dev/null &
-nsx gre timeout 3 tcpdump -i g1 -U -w "$DIR/gre.pcap" proto gre 2>/dev/null &
+nsx gre timeout 3 tcpdump --immediate-mode -i g1 -U -w "$DIR/gre.pcap" proto gre 2>/dev/null &
 sleep 0.5
 echo "GET /" | nsx vm timeout 2 socat -u - TCP:10.77.0.2:8080,connect-timeout=1 2>/dev/null || true
 echo "login" | nsx vm timeout 2 socat -u - TCP:10.77.0.2:23,connect-timeout=1 2>/dev/null || true

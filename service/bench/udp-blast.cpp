@@ -45,8 +45,8 @@ int main(int argc, char** argv) {
   }
   uint8_t smac[6], dmac[6];
   in_addr sa{}, da{};
-  if (!ParseMac(argv[2], smac) || !ParseMac(argv[3], dmac) || inet_pton(AF_INET, argv[4], &sa) != 1 ||
-      inet_pton(AF_INET, argv[5], &da) != 1) {
+  if (!ParseMac(argv[2], smac) || !ParseMac(argv[3], dmac) ||
+      inet_pton(AF_INET, argv[4], &sa) != 1 || inet_pton(AF_INET, argv[5], &da) != 1) {
     std::fprintf(stderr, "udp-blast: bad address\n");
     return 2;
   }

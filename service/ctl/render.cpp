@@ -5,13 +5,11 @@
 namespace ctl {
 namespace {
 
-std::string Str(const nlohmann::json& j) {
-  return j.is_string() ? j.get<std::string>() : j.dump();
-}
+std::string Str(const nlohmann::json& j) { return j.is_string() ? j.get<std::string>() : j.dump(); }
 
 // The fields of a rule summary worth a column when not a wildcard.
-constexpr const char* kMatchFields[] = {"dMac", "sMac",  "ethType", "vlan1QTag", "ipSa",
-                                        "ipDa", "ipProto", "sPort", "dPort"};
+constexpr const char* kMatchFields[] = {"dMac", "sMac",    "ethType", "vlan1QTag", "ipSa",
+                                        "ipDa", "ipProto", "sPort",   "dPort"};
 
 // "SLCGenericActionDrop (drop packets)" -> "Drop".
 std::string Short(const nlohmann::json& j, const std::string& prefix) {
@@ -44,8 +42,8 @@ std::string RenderStatus(const nlohmann::json& tree) {
       }
       const auto rules = f.value("rules", nlohmann::json::array());
       if (!rules.empty()) {
-        out += fmt::format("    {:>5} {:<12} {:<6} {:>12} {:>14}  match\n", "rule", "action",
-                           "dir", "packets", "bytes");
+        out += fmt::format("    {:>5} {:<12} {:<6} {:>12} {:>14}  match\n", "rule", "action", "dir",
+                           "packets", "bytes");
       }
       for (const auto& r : rules) {
         std::string match;

@@ -2,9 +2,8 @@
 // Kept apart from the command so it can be swapped for a shared renderer.
 #pragma once
 
-#include <string>
-
 #include <nlohmann/json.hpp>
+#include <string>
 
 namespace ctl {
 

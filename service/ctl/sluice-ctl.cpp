@@ -3,6 +3,7 @@
 // module's own channel for it.
 #include <unistd.h>
 
+#include <CLI/CLI.hpp>
 #include <cstdio>
 #include <fstream>
 #include <iostream>
@@ -10,8 +11,6 @@
 #include <sstream>
 #include <string>
 #include <vector>
-
-#include <CLI/CLI.hpp>
 
 #include "service/ctl/render.h"
 #include "service/protocol/protocol.h"
@@ -125,9 +124,10 @@ int main(int argc, char** argv) {
   agent->add_option("text", agentText, "NAME[:default-action=ACTION_...]")->required();
   auto* addPort = app.add_subcommand("add-port", "open a port while the host runs");
   std::string portSpec;
-  addPort->add_option("spec", portSpec,
-                      "name=FILTER,agent=AGENT,vm=IF,switch=IF[,uuid=U][,vnic=N][,endpoint=N]"
-                      "[,failure=N]")
+  addPort
+      ->add_option("spec", portSpec,
+                   "name=FILTER,agent=AGENT,vm=IF,switch=IF[,uuid=U][,vnic=N][,endpoint=N]"
+                   "[,failure=N]")
       ->required();
   auto* removePort = app.add_subcommand("remove-port", "destroy a port's filter and close it");
   std::string portName;
@@ -278,8 +278,7 @@ int main(int argc, char** argv) {
   if (c.json) {
     body.erase("ok");
     body.erase("inBlob");
-    std::printf("%s\n",
-                body.dump(2, ' ', false, nlohmann::json::error_handler_t::replace).c_str());
+    std::printf("%s\n", body.dump(2, ' ', false, nlohmann::json::error_handler_t::replace).c_str());
   } else if (*status) {
     std::fputs(ctl::RenderStatus(body).c_str(), stdout);
   } else if (*stats) {

@@ -97,7 +97,7 @@ bool ControlServer::Start(const std::string& path, std::string* error) {
     *error = std::string("socket: ") + std::strerror(errno);
     return false;
   }
-  struct stat st{};
+  struct stat st {};
   if (lstat(path.c_str(), &st) == 0 && S_ISSOCK(st.st_mode)) unlink(path.c_str());
   // The socket is created with no access for anyone but the owner, so there
   // is no window in which another user could connect.
@@ -147,8 +147,9 @@ void ControlServer::ServeConnection(int fd) {
   socklen_t len = sizeof cred;
   if (getsockopt(fd, SOL_SOCKET, SO_PEERCRED, &cred, &len) != 0 ||
       (cred.uid != 0 && cred.uid != geteuid())) {
-    (void)slcproto::WriteMessage(fd, Fail("permission denied: peer uid " +
-                                          std::to_string(cred.uid) + " may not control this host"),
+    (void)slcproto::WriteMessage(fd,
+                                 Fail("permission denied: peer uid " + std::to_string(cred.uid) +
+                                      " may not control this host"),
                                  &error);
     return;
   }
@@ -375,8 +376,8 @@ Message ControlServer::Device(const Message& req) {
       std::vector<uint8_t> summary;
       if (host::StatusTree::List({"agents", agent, "filters"}, &filters) == ZEL_OK) {
         for (const auto& f : filters) {
-          if (host::StatusTree::Get({"agents", agent, "filters", f, "ruleSetSummary"},
-                                    &summary) == ZEL_OK &&
+          if (host::StatusTree::Get({"agents", agent, "filters", f, "ruleSetSummary"}, &summary) ==
+                  ZEL_OK &&
               summary.size() >= sizeof(SLCGeneric_RuleSetSummary)) {
             uint32_t n;
             std::memcpy(&n, summary.data() + offsetof(SLCGeneric_RuleSetSummary, numRules), 4);
@@ -468,15 +469,13 @@ Message ControlServer::Status(const Message& req) {
   }
   Message m = Reply(true);
   m.args["agents"] = std::move(tree);
-  std::string dumped =
-      m.args.dump(-1, ' ', false, nlohmann::json::error_handler_t::replace);
+  std::string dumped = m.args.dump(-1, ' ', false, nlohmann::json::error_handler_t::replace);
   if (dumped.size() > slcproto::kMaxArgs) {
     // Too big for the argument part: the tree goes in the blob as JSON.
     m.args = Reply(true).args;
     m.args["inBlob"] = true;
     nlohmann::json agentsOnly = {{"agents", std::move(tree)}};
-    std::string text =
-        agentsOnly.dump(-1, ' ', false, nlohmann::json::error_handler_t::replace);
+    std::string text = agentsOnly.dump(-1, ' ', false, nlohmann::json::error_handler_t::replace);
     if (text.size() > slcproto::kMaxBlob) return Fail("status tree too large; ask for fewer rules");
     m.blob.assign(text.begin(), text.end());
   }
@@ -486,8 +485,8 @@ Message ControlServer::Status(const Message& req) {
 Message ControlServer::Stats() {
   Message m = Reply(true);
   const ZelHeapID heap = host::Heaps::ModuleHeap();
-  const host::HeapStats hs = heap != nullptr && host::Heaps::Exists(heap) ? host::Heaps::Stats(heap)
-                                                                          : host::HeapStats{};
+  const host::HeapStats hs =
+      heap != nullptr && host::Heaps::Exists(heap) ? host::Heaps::Stats(heap) : host::HeapStats{};
   m.args["heapBytes"] = hs.bytes;
   m.args["heapBlocks"] = hs.blocks;
   m.args["livePackets"] = host::Packets::Live();

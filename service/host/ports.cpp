@@ -5,6 +5,7 @@
 #include <net/ethernet.h>
 #include <net/if.h>
 #include <poll.h>
+#include <sys/mman.h>
 #include <sys/socket.h>
 #include <unistd.h>
 
@@ -17,9 +18,14 @@
 namespace service {
 namespace {
 
-// Largest frame taken from an interface: an MTU-sized frame with a VLAN tag
-// and room to spare; anything longer came from segmentation offload.
-constexpr size_t kFrameMax = 9216 + 18;
+constexpr size_t kFrameMax = Port::kFrameMax;
+
+// Receive ring: 32 blocks of 256 KiB, a block handed over when full or
+// after 1 ms, so a lone frame waits at most that long.
+constexpr uint32_t kRingBlockSize = 1u << 18;
+constexpr uint32_t kRingBlocks = 32;
+constexpr uint32_t kRingFrameSize = 2048;
+constexpr uint32_t kRingRetireMs = 1;
 
 bool ParseU32(const std::string& v, uint32_t* out) {
   if (v.empty() || v.size() > 10) return false;
@@ -81,6 +87,29 @@ int OpenInterface(const std::string& ifname, std::string* error) {
   return fd;
 }
 
+// Maps a TPACKET_V3 receive ring on `fd`; false (and no ring) when the
+// kernel refuses one.
+bool MapRing(int fd, uint8_t** map, size_t* mapLen) {
+  const int version = TPACKET_V3;
+  tpacket_req3 req{};
+  req.tp_block_size = kRingBlockSize;
+  req.tp_block_nr = kRingBlocks;
+  req.tp_frame_size = kRingFrameSize;
+  req.tp_frame_nr = kRingBlockSize / kRingFrameSize * kRingBlocks;
+  req.tp_retire_blk_tov = kRingRetireMs;
+  if (setsockopt(fd, SOL_PACKET, PACKET_VERSION, &version, sizeof version) != 0 ||
+      setsockopt(fd, SOL_PACKET, PACKET_RX_RING, &req, sizeof req) != 0) {
+    return false;
+  }
+  const size_t len = size_t{kRingBlockSize} * kRingBlocks;
+  void* m = mmap(nullptr, len, PROT_READ | PROT_WRITE, MAP_SHARED | MAP_LOCKED, fd, 0);
+  if (m == MAP_FAILED) m = mmap(nullptr, len, PROT_READ | PROT_WRITE, MAP_SHARED, fd, 0);
+  if (m == MAP_FAILED) return false;
+  *map = static_cast<uint8_t*>(m);
+  *mapLen = len;
+  return true;
+}
+
 }  // namespace
 
 bool ParsePortSpec(const std::string& text, PortSpec* out, std::string* error) {
@@ -95,15 +124,23 @@ bool ParsePortSpec(const std::string& text, PortSpec* out, std::string* error) {
     }
     const std::string k = item.substr(0, eq), v = item.substr(eq + 1);
     bool ok = true;
-    if (k == "name") s.name = v;
-    else if (k == "agent") s.agent = v;
-    else if (k == "vm") s.vmIf = v;
-    else if (k == "switch") s.switchIf = v;
-    else if (k == "uuid") s.vmUUID = v;
-    else if (k == "vnic") ok = ParseU32(v, &s.vnicIndex);
-    else if (k == "endpoint") ok = ParseU32(v, &s.endPointType);
-    else if (k == "failure") ok = ParseU32(v, &s.failurePolicy);
-    else {
+    if (k == "name") {
+      s.name = v;
+    } else if (k == "agent") {
+      s.agent = v;
+    } else if (k == "vm") {
+      s.vmIf = v;
+    } else if (k == "switch") {
+      s.switchIf = v;
+    } else if (k == "uuid") {
+      s.vmUUID = v;
+    } else if (k == "vnic") {
+      ok = ParseU32(v, &s.vnicIndex);
+    } else if (k == "endpoint") {
+      ok = ParseU32(v, &s.endPointType);
+    } else if (k == "failure") {
+      ok = ParseU32(v, &s.failurePolicy);
+    } else {
       *error = "unknown port field: " + k;
       return false;
     }
@@ -118,9 +155,14 @@ bool ParsePortSpec(const std::string& text, PortSpec* out, std::string* error) {
 }
 
 nlohmann::json PortSpecToJson(const PortSpec& s) {
-  return {{"name", s.name},         {"agent", s.agent},       {"vm", s.vmIf},
-          {"switch", s.switchIf},   {"uuid", s.vmUUID},       {"vnic", s.vnicIndex},
-          {"endpoint", s.endPointType}, {"failure", s.failurePolicy}};
+  return {{"name", s.name},
+          {"agent", s.agent},
+          {"vm", s.vmIf},
+          {"switch", s.switchIf},
+          {"uuid", s.vmUUID},
+          {"vnic", s.vnicIndex},
+          {"endpoint", s.endPointType},
+          {"failure", s.failurePolicy}};
 }
 
 bool PortSpecFromJson(const nlohmann::json& j, PortSpec* out, std::string* error) {
@@ -159,6 +201,13 @@ std::unique_ptr<Port> Port::Open(const PortSpec& spec, std::string* error, bool 
   if (port->fd_[1] < 0) return nullptr;
   port->fd_[2] = OpenInterface(spec.vmIf, error);
   if (port->fd_[2] < 0) return nullptr;
+  for (int side : {1, 2}) {
+    Ring& r = port->ring_[side];
+    if (MapRing(port->fd_[side], &r.map, &r.mapLen)) {
+      r.blockSize = kRingBlockSize;
+      r.blocks = kRingBlocks;
+    }
+  }
 
   host::FilterConfig config;
   config.name = spec.name;
@@ -184,8 +233,10 @@ std::unique_ptr<Port> Port::Open(const PortSpec& spec, std::string* error, bool 
 void Port::StartReaders() {
   StopReaders();
   stop_ = false;
-  readers_[1] = std::thread([this] { Reader(1); });
-  readers_[2] = std::thread([this] { Reader(2); });
+  for (int side : {1, 2}) {
+    readers_[side] = ring_[side].map != nullptr ? std::thread([this, side] { RingReader(side); })
+                                                : std::thread([this, side] { Reader(side); });
+  }
 }
 
 void Port::StopReaders() {
@@ -231,19 +282,27 @@ bool Port::Close(int waitMs) {
 Port::~Port() {
   if (filter_ != 0 || readers_[1].joinable() || readers_[2].joinable()) (void)Close();
   for (int side : {1, 2}) {
+    if (ring_[side].map != nullptr) munmap(ring_[side].map, ring_[side].mapLen);
     if (fd_[side] >= 0) close(fd_[side]);
   }
 }
 
 nlohmann::json Port::Stats() const {
   auto& c = counters_;
-  return {{"rxFromSwitch", c.rx[1].load()}, {"rxFromVm", c.rx[2].load()},
-          {"txToVm", c.tx[1].load()},       {"txToSwitch", c.tx[2].load()},
-          {"turnedBack", c.turnedBack.load()}, {"slowPath", c.slowPath.load()},
+  return {{"rxFromSwitch", c.rx[1].load()},
+          {"rxFromVm", c.rx[2].load()},
+          {"txToVm", c.tx[1].load()},
+          {"txToSwitch", c.tx[2].load()},
+          {"turnedBack", c.turnedBack.load()},
+          {"slowPath", c.slowPath.load()},
           {"fromSlowPath", c.fromSlowPath.load()},
-          {"oversize", c.oversize.load()},  {"txErrors", c.txErrors.load()},
-          {"batches", c.batches.load()}, {"busyNs", c.busyNs.load()},
-          {"moduleNs", c.moduleNs.load()}};
+          {"oversize", c.oversize.load()},
+          {"txErrors", c.txErrors.load()},
+          {"batches", c.batches.load()},
+          {"busyNs", c.busyNs.load()},
+          {"moduleNs", c.moduleNs.load()},
+          {"txNs", c.txNs.load()},
+          {"rxRings", ring_[1].map != nullptr && ring_[2].map != nullptr}};
 }
 
 // Sends every packet left in `list` on `fd` and releases them.
@@ -298,57 +357,107 @@ void Port::TransmitDeliveries(std::vector<host::Delivery> deliveries) {
   }
 }
 
-void Port::Reader(int side) {
+void Port::Process(int side, std::span<const RxFrame> frames) {
+  const auto t0 = std::chrono::steady_clock::now();
   const uint32_t direction = static_cast<uint32_t>(side);
+  counters_.rx[side] += frames.size();
+  counters_.batches++;
+  host::PacketList list;
+  for (const RxFrame& f : frames) {
+    if (f.len < f.wireLen || f.wireLen > kFrameMax) {
+      counters_.oversize++;
+      continue;
+    }
+    list.Append(host::Packets::Make(std::span<const uint8_t>(f.data, f.len)));
+  }
+  if (list.Count() == 0) return;
+  const auto t1 = std::chrono::steady_clock::now();
+  (void)host::Sluice::Deliver(filter_, list, direction);
+  const auto t2 = std::chrono::steady_clock::now();
+  counters_.moduleNs +=
+      static_cast<uint64_t>(std::chrono::duration_cast<std::chrono::nanoseconds>(t2 - t1).count());
+  Transmit(fd_[side == 1 ? 2 : 1], list, direction);
+  counters_.txNs += static_cast<uint64_t>(
+      std::chrono::duration_cast<std::chrono::nanoseconds>(std::chrono::steady_clock::now() - t2)
+          .count());
+  if (host::Sluice::IssuedCount(filter_) > 0) {
+    TransmitDeliveries(host::Sluice::TakeIssued(filter_));
+  }
+  if (host::Sluice::FaultedCount(filter_) > 0) {
+    for (auto& d : host::Sluice::TakeFaulted(filter_)) {
+      counters_.slowPath += d.packets.size();
+      for (ZelPkt* pkt : d.packets) zel_PktRelease(pkt);
+    }
+  }
+  counters_.busyNs += static_cast<uint64_t>(
+      std::chrono::duration_cast<std::chrono::nanoseconds>(std::chrono::steady_clock::now() - t0)
+          .count());
+}
+
+void Port::Reader(int side) {
   const int inFd = fd_[side];
-  const int outFd = fd_[side == 1 ? 2 : 1];
   std::vector<uint8_t> storage(size_t{kBatch} * kFrameMax);
   iovec iov[kBatch];
   mmsghdr msgs[kBatch];
+  RxFrame frames[kBatch];
   while (!stop_.load(std::memory_order_relaxed)) {
     pollfd p{inFd, POLLIN, 0};
-    int r = poll(&p, 1, 50);
-    if (r <= 0) continue;
+    if (poll(&p, 1, 50) <= 0) continue;
     for (unsigned i = 0; i < kBatch; i++) {
       iov[i] = {storage.data() + size_t{i} * kFrameMax, kFrameMax};
       msgs[i] = {};
       msgs[i].msg_hdr.msg_iov = &iov[i];
       msgs[i].msg_hdr.msg_iovlen = 1;
     }
-    int n = recvmmsg(inFd, msgs, kBatch, MSG_DONTWAIT, nullptr);
+    int n = recvmmsg(inFd, msgs, kBatch, MSG_DONTWAIT | MSG_TRUNC, nullptr);
     if (n <= 0) continue;
-    const auto t0 = std::chrono::steady_clock::now();
-    counters_.rx[side] += static_cast<uint64_t>(n);
-    counters_.batches++;
-    host::PacketList list;
     for (int i = 0; i < n; i++) {
-      if (msgs[i].msg_hdr.msg_flags & MSG_TRUNC) {
-        counters_.oversize++;
-        continue;
-      }
-      list.Append(host::Packets::Make(
-          std::span<const uint8_t>(storage.data() + size_t(i) * kFrameMax, msgs[i].msg_len)));
+      // With MSG_TRUNC msg_len is the frame's real length.
+      frames[i] = {storage.data() + size_t(i) * kFrameMax,
+                   std::min<uint32_t>(msgs[i].msg_len, kFrameMax), msgs[i].msg_len};
     }
-    if (list.Count() == 0) continue;
-    const auto t1 = std::chrono::steady_clock::now();
-    (void)host::Sluice::Deliver(filter_, list, direction);
-    const auto t2 = std::chrono::steady_clock::now();
-    counters_.moduleNs += static_cast<uint64_t>(
-        std::chrono::duration_cast<std::chrono::nanoseconds>(t2 - t1).count());
-    Transmit(outFd, list, direction);
-    if (host::Sluice::IssuedCount(filter_) > 0) {
-      TransmitDeliveries(host::Sluice::TakeIssued(filter_));
-    }
-    if (host::Sluice::FaultedCount(filter_) > 0) {
-      for (auto& d : host::Sluice::TakeFaulted(filter_)) {
-        counters_.slowPath += d.packets.size();
-        for (ZelPkt* pkt : d.packets) zel_PktRelease(pkt);
-      }
-    }
-    counters_.busyNs += static_cast<uint64_t>(std::chrono::duration_cast<std::chrono::nanoseconds>(
-                                                  std::chrono::steady_clock::now() - t0)
-                                                  .count());
+    Process(side, std::span<const RxFrame>(frames, static_cast<size_t>(n)));
   }
+}
+
+// Walks the ring block by block: a block belongs to this thread from the
+// kernel's TP_STATUS_USER until it is handed back with TP_STATUS_KERNEL.
+void Port::RingReader(int side) {
+  Ring& ring = ring_[side];
+  // A restarted reader goes on with the block the kernel fills next.
+  uint32_t current = ring.next;
+  RxFrame frames[kBatch];
+  while (!stop_.load(std::memory_order_relaxed)) {
+    auto* block =
+        reinterpret_cast<tpacket_block_desc*>(ring.map + size_t{current} * ring.blockSize);
+    if ((__atomic_load_n(&block->hdr.bh1.block_status, __ATOMIC_ACQUIRE) & TP_STATUS_USER) == 0) {
+      pollfd p{fd_[side], POLLIN | POLLERR, 0};
+      (void)poll(&p, 1, 50);
+      continue;
+    }
+    const uint32_t count = block->hdr.bh1.num_pkts;
+    const uint8_t* const blockEnd = ring.map + size_t{current + 1} * ring.blockSize;
+    const uint8_t* at =
+        reinterpret_cast<const uint8_t*>(block) + block->hdr.bh1.offset_to_first_pkt;
+    size_t n = 0;
+    for (uint32_t i = 0; i < count && at + sizeof(tpacket3_hdr) <= blockEnd; i++) {
+      const auto* h = reinterpret_cast<const tpacket3_hdr*>(at);
+      const uint8_t* data = at + h->tp_mac;
+      if (data + h->tp_snaplen <= blockEnd) {
+        frames[n++] = {data, h->tp_snaplen, h->tp_len};
+        if (n == kBatch) {
+          Process(side, std::span<const RxFrame>(frames, n));
+          n = 0;
+        }
+      }
+      if (h->tp_next_offset == 0) break;
+      at += h->tp_next_offset;
+    }
+    if (n > 0) Process(side, std::span<const RxFrame>(frames, n));
+    __atomic_store_n(&block->hdr.bh1.block_status, TP_STATUS_KERNEL, __ATOMIC_RELEASE);
+    current = (current + 1) % ring.blocks;
+  }
+  ring.next = current;
 }
 
 }  // namespace service

@@ -6,28 +6,29 @@
 // and lists for the slow path go to the slow path the filter is attached to
 // (or, with none, are counted and released).
 //
-// Interfaces are read and written through AF_PACKET sockets in promiscuous
-// mode. Senders must not leave checksums or segmentation to offload: a
-// frame larger than the buffer is counted as oversize and dropped.
+// Interfaces are read through TPACKET_V3 receive rings on AF_PACKET sockets
+// in promiscuous mode (or recvmmsg where a ring cannot be set up) and
+// written with sendmmsg. Senders must not leave checksums or segmentation to
+// offload: a frame longer than kFrameMax is counted as oversize and dropped.
 #pragma once
 
 #include <atomic>
 #include <cstdint>
 #include <memory>
+#include <nlohmann/json.hpp>
+#include <span>
 #include <string>
 #include <thread>
-
-#include <nlohmann/json.hpp>
 
 #include "host/sluice/framework.h"
 
 namespace service {
 
 struct PortSpec {
-  std::string name;          // the filter's name
+  std::string name;  // the filter's name
   std::string agent;
-  std::string vmIf;          // VM-side interface
-  std::string switchIf;      // switch-side interface
+  std::string vmIf;      // VM-side interface
+  std::string switchIf;  // switch-side interface
   std::string vmUUID;
   uint32_t vnicIndex = 0;
   uint32_t endPointType = 0;
@@ -52,11 +53,15 @@ struct PortCounters {
   // inside the filter's packet callback.
   std::atomic<uint64_t> busyNs{0};
   std::atomic<uint64_t> moduleNs{0};
+  std::atomic<uint64_t> txNs{0};  // of that, in sending what passed
 };
 
 class Port {
  public:
   static constexpr unsigned kBatch = 64;
+  // An MTU-sized frame with a VLAN tag and room to spare; anything longer
+  // came from segmentation offload.
+  static constexpr uint32_t kFrameMax = 9216 + 18;
 
   // Opens both interfaces, creates the filter through the framework and
   // (unless `start` is false) starts one reader per side. Null with a reason
@@ -81,14 +86,30 @@ class Port {
 
  private:
   Port() = default;
+  struct RxFrame {
+    const uint8_t* data;
+    uint32_t len;      // bytes at data
+    uint32_t wireLen;  // length on the wire
+  };
+  struct Ring {
+    uint8_t* map = nullptr;
+    size_t mapLen = 0;
+    uint32_t blockSize = 0;
+    uint32_t blocks = 0;
+    uint32_t next = 0;   // the block to read next; kept while readers are stopped
+  };
   void Reader(int side);
+  void RingReader(int side);
+  // Hands `frames` read on `side` to the filter and sends what it leaves.
+  void Process(int side, std::span<const RxFrame> frames);
   void Transmit(int fd, host::PacketList& list, uint32_t direction);
   // Sends each delivery out on the side its direction leads to.
   void TransmitDeliveries(std::vector<host::Delivery> deliveries);
 
   PortSpec spec_;
   host::FilterId filter_ = 0;
-  int fd_[3] = {-1, -1, -1};       // [1] switch side, [2] VM side
+  int fd_[3] = {-1, -1, -1};  // [1] switch side, [2] VM side
+  Ring ring_[3];
   std::atomic<bool> stop_{false};
   std::thread readers_[3];
   PortCounters counters_;

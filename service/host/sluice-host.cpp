@@ -4,13 +4,12 @@
 // left no heap bytes, packets, timers or other objects behind.
 #include <signal.h>
 
+#include <CLI/CLI.hpp>
 #include <chrono>
 #include <cstdio>
 #include <fstream>
 #include <string>
 #include <vector>
-
-#include <CLI/CLI.hpp>
 
 #include "host/core/host_core.h"
 #include "host/net/packets.h"
@@ -58,11 +57,15 @@ bool ReadConfig(const std::string& path, Config* c, std::string* error) {
       *error = path + ":" + std::to_string(n) + ": '" + key + "' needs a value";
       return false;
     }
-    if (key == "agent") c->agents.push_back(value);
-    else if (key == "port") c->ports.push_back(value);
-    else if (key == "socket") c->socketPath = value;
-    else if (key == "gre") c->gre = value;
-    else {
+    if (key == "agent") {
+      c->agents.push_back(value);
+    } else if (key == "port") {
+      c->ports.push_back(value);
+    } else if (key == "socket") {
+      c->socketPath = value;
+    } else if (key == "gre") {
+      c->gre = value;
+    } else {
       *error = path + ":" + std::to_string(n) + ": unknown setting '" + key + "'";
       return false;
     }
@@ -173,19 +176,18 @@ int main(int argc, char** argv) {
       rc = 1;
     }
     if (rc == 0) {
-      std::fprintf(stderr, "sluice-host: serving on %s (pid %d)\n", c.socketPath.c_str(),
-                   getpid());
+      std::fprintf(stderr, "sluice-host: serving on %s (pid %d)\n", c.socketPath.c_str(), getpid());
       const auto start = std::chrono::steady_clock::now();
       for (;;) {
         timespec tick{0, 100 * 1000 * 1000};
         nanosleep(&tick, nullptr);
         if (const int sig = gStopSignal; sig != 0) {
-          std::fprintf(stderr, "sluice-host: %s, stopping\n", sig == SIGTERM ? "SIGTERM" : "SIGINT");
+          std::fprintf(stderr, "sluice-host: %s, stopping\n",
+                       sig == SIGTERM ? "SIGTERM" : "SIGINT");
           break;
         }
-        if (c.maxSeconds > 0 &&
-            std::chrono::steady_clock::now() - start >
-                std::chrono::duration<double>(c.maxSeconds)) {
+        if (c.maxSeconds > 0 && std::chrono::steady_clock::now() - start >
+                                    std::chrono::duration<double>(c.maxSeconds)) {
           std::fprintf(stderr, "sluice-host: ran for %.0f seconds, stopping\n", c.maxSeconds);
           break;
         }

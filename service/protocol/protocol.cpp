@@ -89,8 +89,8 @@ bool ParseHeader(std::span<const uint8_t> bytes, Header* header, std::string* er
     return false;
   }
   if (header->blobLen > kMaxBlob) {
-    *error = "data of " + std::to_string(header->blobLen) + " bytes exceeds " +
-             std::to_string(kMaxBlob);
+    *error =
+        "data of " + std::to_string(header->blobLen) + " bytes exceeds " + std::to_string(kMaxBlob);
     return false;
   }
   return true;

@@ -2,6 +2,7 @@
 // facing hostile clients: every malformed request gets an error reply, the
 // host keeps serving and the module heap is what it was.
 #include <fcntl.h>
+#include <gtest/gtest.h>
 #include <signal.h>
 #include <sys/socket.h>
 #include <sys/stat.h>
@@ -10,11 +11,10 @@
 
 #include <chrono>
 #include <cstring>
+#include <fstream>
 #include <random>
 #include <string>
 #include <thread>
-
-#include <gtest/gtest.h>
 
 #include "service/protocol/protocol.h"
 
@@ -71,13 +71,13 @@ TEST(ServiceProtocol, RefusesHeadersOutsideTheBounds) {
 }
 
 TEST(ServiceProtocol, RefusesBodiesThatAreNotAnObject) {
-  for (const std::string& args : std::vector<std::string>{"[1,2]", "{\"a\":", "\"text\"", std::string("\xff\xfe", 2)}) {
+  for (const std::string& args :
+       std::vector<std::string>{"[1,2]", "{\"a\":", "\"text\"", std::string("\xff\xfe", 2)}) {
     slcproto::Header h{slcproto::kVersion, 0x100, static_cast<uint32_t>(args.size()), 0};
     Message out;
     std::string error;
-    EXPECT_FALSE(slcproto::ParseBody(h, std::span(reinterpret_cast<const uint8_t*>(args.data()),
-                                                  args.size()),
-                                     &out, &error))
+    EXPECT_FALSE(slcproto::ParseBody(
+        h, std::span(reinterpret_cast<const uint8_t*>(args.data()), args.size()), &out, &error))
         << args;
   }
   slcproto::Header h{slcproto::kVersion, 0x100, 2, 3};
@@ -100,9 +100,8 @@ class ServiceHostTest : public ::testing::Test {
     if (pid_ == 0) {
       int devnull = open("/dev/null", O_WRONLY);
       dup2(devnull, 2);
-      execl(SLUICE_HOST_BIN, "sluice-host", "--socket", sock_.c_str(), "--gre", "memory",
-            "--agent", "fw:default-action=ACTION_ACCEPT", "--max-seconds", "60",
-            static_cast<char*>(nullptr));
+      execl(SLUICE_HOST_BIN, "sluice-host", "--socket", sock_.c_str(), "--gre", "memory", "--agent",
+            "fw:default-action=ACTION_ACCEPT", "--max-seconds", "60", static_cast<char*>(nullptr));
       _exit(127);
     }
     for (int i = 0; i < 100; i++) {
@@ -161,7 +160,7 @@ class ServiceHostTest : public ::testing::Test {
 };
 
 TEST_F(ServiceHostTest, SocketIsPrivateToItsOwner) {
-  struct stat st{};
+  struct stat st {};
   ASSERT_EQ(stat(sock_.c_str(), &st), 0);
   EXPECT_EQ(st.st_mode & 0777, 0600u);
 }
@@ -209,8 +208,9 @@ TEST_F(ServiceHostTest, MalformedRequestsGetAnErrorAndChangeNothing) {
       {Type::kRulesetRead, {}, {}},
       {Type::kCreateAgent, {{"text", std::string(5000, 'a')}}, {}},
       {Type::kCreateAgent, {{"text", nlohmann::json::array()}}, {}},
-      {Type::kAddPort, {{"port", {{"name", "p"}, {"agent", "fw"}, {"vm", "nope0"},
-                                  {"switch", "nope1"}}}}, {}},
+      {Type::kAddPort,
+       {{"port", {{"name", "p"}, {"agent", "fw"}, {"vm", "nope0"}, {"switch", "nope1"}}}},
+       {}},
       {Type::kAddPort, {{"port", {{"name", "p"}, {"vnic", -1}}}}, {}},
       {Type::kRemovePort, {{"name", "p"}}, {}},
       {Type::kDevSetRuleset, {{"uuid", "u"}, {"vnic", 1}, {"agent", "fw"}}, Bytes(3, 0)},
@@ -271,6 +271,61 @@ TEST_F(ServiceHostTest, PeersOfAnotherUserAreRefused) {
   EXPECT_EQ(WEXITSTATUS(status), 0) << "10: setuid, 11: no reply, 12: accepted";
   Message hello;
   EXPECT_TRUE(Request(Type::kHello, &hello));
+}
+
+// Settings from a file: the host takes its socket and agents from it, and
+// refuses a file with an unknown setting before loading anything.
+TEST(ServiceHostConfig, ReadsSettingsFromAFileAndRefusesUnknownOnes) {
+  char tmpl[] = "/tmp/sluice-cfg-test.XXXXXX";
+  ASSERT_NE(mkdtemp(tmpl), nullptr);
+  const std::string dir = tmpl, sock = dir + "/c.sock", good = dir + "/good.conf",
+                    bad = dir + "/bad.conf";
+  std::ofstream(good) << "# a host from a file\n"
+                      << "socket " << sock << "\n"
+                      << "agent cfg:default-action=ACTION_DROP   # trailing comment\n"
+                      << "gre memory\n";
+  std::ofstream(bad) << "agent x\nbogus 1\n";
+  auto spawn = [](const std::string& config) {
+    pid_t pid = fork();
+    if (pid == 0) {
+      int devnull = open("/dev/null", O_WRONLY);
+      dup2(devnull, 2);
+      execl(SLUICE_HOST_BIN, "sluice-host", "--config", config.c_str(), "--max-seconds", "30",
+            static_cast<char*>(nullptr));
+      _exit(127);
+    }
+    return pid;
+  };
+  auto exitStatus = [](pid_t pid) {
+    int status = 0;
+    waitpid(pid, &status, 0);
+    return WIFEXITED(status) ? WEXITSTATUS(status) : 128 + WTERMSIG(status);
+  };
+
+  EXPECT_EQ(exitStatus(spawn(bad)), 2);
+
+  pid_t pid = spawn(good);
+  ASSERT_GT(pid, 0);
+  Message status;
+  bool up = false;
+  for (int i = 0; i < 100 && !up; i++) {
+    Message req;
+    req.type = Type::kStatus;
+    req.args["agent"] = "cfg";
+    std::string error;
+    up = slcproto::Call(sock, req, &status, &error, 5000);
+    if (!up) std::this_thread::sleep_for(std::chrono::milliseconds(50));
+  }
+  EXPECT_TRUE(up);
+  if (up) {
+    ASSERT_EQ(status.args["agents"].size(), 1u);
+    EXPECT_EQ(status.args["agents"][0]["name"], "cfg");
+  }
+  kill(pid, SIGTERM);
+  EXPECT_EQ(exitStatus(pid), 0);
+  unlink(good.c_str());
+  unlink(bad.c_str());
+  rmdir(dir.c_str());
 }
 
 }  // namespace

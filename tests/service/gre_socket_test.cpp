@@ -1,14 +1,13 @@
 // The host's kernel socket backend: what the module sends on a GRE socket
 // leaves through a real raw socket and arrives, behind an IPv4 header the
 // kernel added, at the destination (here loopback).
+#include <gtest/gtest.h>
 #include <netinet/in.h>
 #include <poll.h>
 #include <sys/socket.h>
 #include <unistd.h>
 
 #include <cstring>
-
-#include <gtest/gtest.h>
 
 #include "host/core/host_core.h"
 #include "host/net/packets.h"

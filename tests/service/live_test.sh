@@ -33,7 +33,7 @@ cleanup() {
     kill -KILL "$HOST_PID" 2>/dev/null
   fi
   topo_down "$P"
-  rm -rf "$DIR"
+  [ -n "${KEEP_DIR:-}" ] || rm -rf "$DIR"
 }
 trap cleanup EXIT
 trap 'exit 1' INT TERM
@@ -55,10 +55,13 @@ send_udp() {  # send_udp FROM_NS TO_ADDR PORT COUNT [PAYLOAD_BYTES]
 }
 # Receives UDP datagrams on PORT in namespace NS for SECONDS into FILE.
 recv_udp() {  # recv_udp NS PORT SECONDS FILE
-  in_ns "$1" timeout "$3" socat -u "UDP-RECV:$2" - >"$4" 2>/dev/null &
+  # Started through ip directly (not a function) so that $! is the
+  # receiver and killing it ends it.
+  ip netns exec "$P-$1" timeout "$3" socat -u "UDP-RECV:$2" - >"$4" 2>/dev/null &
   LAST_RECV=$!
 }
 rule_packets() {  # rule_packets INDEX: packet counter of rule INDEX
+  sleep 0.3  # the last frames may still sit in a receive ring block
   ctl --json status --agent fw | python3 -c '
 import json, sys
 t = json.load(sys.stdin)
@@ -89,9 +92,9 @@ send_udp vm 10.77.0.2 5000 5; send_udp vm 10.77.0.2 6000 5; wait $R1 $R2
 check "udp to an open port arrives" test "$(wc -l <"$DIR/u5000")" -eq 5
 check "udp to a dropped port does not" test "$(wc -l <"$DIR/u6000")" -eq 0
 
-in_ns net timeout 5 socat -u TCP-LISTEN:7000,reuseaddr - >"$DIR/t7000" 2>/dev/null &
+ip netns exec "$P-net" timeout 5 socat -u TCP-LISTEN:7000,reuseaddr - >"$DIR/t7000" 2>/dev/null &
 T1=$!
-in_ns net timeout 5 socat -u TCP-LISTEN:7001,reuseaddr - >"$DIR/t7001" 2>/dev/null &
+ip netns exec "$P-net" timeout 5 socat -u TCP-LISTEN:7001,reuseaddr - >"$DIR/t7001" 2>/dev/null &
 T2=$!
 sleep 0.3
 echo "hello over tcp" | in_ns vm timeout 3 socat -u - TCP:10.77.0.2:7000,connect-timeout=2 2>/dev/null
@@ -107,7 +110,7 @@ check "accept counter equals datagrams sent" test "$(rule_packets 0)" = 12
 check "drop counter equals datagrams sent" test "$(rule_packets 1)" = 7
 
 # --- rules changed while traffic flows lose no accepted packet ----------------
-recv_udp net 5200 12 "$DIR/u5200"; sleep 0.3
+recv_udp net 5200 30 "$DIR/u5200"; sleep 0.3
 ( send_udp vm 10.77.0.2 5200 150 ) &
 SENDER=$!
 for i in $(seq 15); do
@@ -121,15 +124,20 @@ check "no accepted datagram lost across 30 rule changes" test "$(wc -l <"$DIR/u5
 set_rules "action=gre gre=10.78.0.2 snaplen=64 ipv4 proto=udp dport=5300" \
   "action=dscp dscp=46 ipv4 proto=udp dport=5400" \
   "action=l2rewrite rewrite=02:00:00:00:77:99 ipv4 proto=udp dport=5500"
-in_ns gre timeout 4 tcpdump -i g1 -U -w "$DIR/gre.pcap" proto gre 2>/dev/null &
+ip netns exec "$P-gre" timeout 10 tcpdump --immediate-mode -i g1 -U -w "$DIR/gre.pcap" proto gre 2>"$DIR/c1.err" &
 C1=$!
-in_ns net timeout 4 tcpdump -i eth0 -U -w "$DIR/net.pcap" udp 2>/dev/null &
+ip netns exec "$P-net" timeout 10 tcpdump --immediate-mode -i eth0 -U -w "$DIR/net.pcap" udp 2>"$DIR/c2.err" &
 C2=$!
-sleep 1
+# Capturing starts when tcpdump says it is listening.
+for _ in $(seq 50); do
+  grep -q listening "$DIR/c1.err" && grep -q listening "$DIR/c2.err" && break
+  sleep 0.1
+done
 send_udp vm 10.77.0.2 5300 4 300
 send_udp vm 10.77.0.2 5400 3
 send_udp net 10.77.0.1 5500 3
-wait $C1 $C2
+sleep 1  # frames still in the filter's receive ring, copies still in flight
+kill -INT $C1 $C2 2>/dev/null; wait $C1 $C2 2>/dev/null
 GRE_COUNT=$(tcpdump -r "$DIR/gre.pcap" -nn 2>/dev/null | wc -l)
 check "4 GRE copies captured" test "$GRE_COUNT" -eq 4
 # Outer IPv4 (20) + GRE (4) + the mirrored frame cut at 64 bytes.
@@ -145,6 +153,28 @@ printf 'action=drop ipv4 proto=udp dport=5600\n' >"$DIR/dev.rules"
 check "device set by uuid and vnic" ctl dev set --uuid 564d-live --vnic 3 "$DIR/dev.rules"
 check "device get by name shows it" bash -c "'$CTL_BIN' --socket '$SOCK' dev get --filter vm1.eth0 | grep -q 'dport=5600'"
 check "device test ioctl" ctl dev test --filter vm1.eth0
+
+# --- hostile rulesets on a live filter: refused, host up, heap unchanged -------
+HEAP1=$(ctl --json stats | python3 -c 'import json,sys; print(json.load(sys.stdin)["heapBytes"])')
+ctl ruleset get vm1.eth0 --wire "$DIR/good.bin"
+python3 - "$DIR" <<'PY'
+import struct, sys
+d = sys.argv[1]
+good = open(d + "/good.bin", "rb").read()
+# header claims far more rules than follow; a header cut short; random bytes
+open(d + "/many.bin", "wb").write(good[:3] + struct.pack("<I", 0xFFFFFFFF) + good[7:])
+open(d + "/short.bin", "wb").write(good[:9])
+import random
+random.seed(9)
+open(d + "/noise.bin", "wb").write(bytes(random.randrange(256) for _ in range(700)))
+PY
+for f in many short noise; do
+  check "property refuses a $f ruleset" bash -c "! '$CTL_BIN' --socket '$SOCK' ruleset set vm1.eth0 --wire '$DIR/$f.bin' 2>/dev/null"
+  check "device refuses a $f ruleset" bash -c "! '$CTL_BIN' --socket '$SOCK' dev set --filter vm1.eth0 --wire '$DIR/$f.bin' 2>/dev/null"
+done
+check "the rules in force survive hostile rulesets" bash -c "'$CTL_BIN' --socket '$SOCK' ruleset get vm1.eth0 | grep -q 'dport=5600'"
+HEAP2=$(ctl --json stats | python3 -c 'import json,sys; print(json.load(sys.stdin)["heapBytes"])')
+check "heap unchanged by hostile rulesets ($HEAP1 -> $HEAP2)" test "$HEAP1" = "$HEAP2"
 
 # --- ports come and go while the host runs --------------------------------------
 check "remove the port" ctl remove-port vm1.eth0
