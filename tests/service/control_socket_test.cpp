@@ -231,6 +231,19 @@ TEST_F(ServiceHostTest, MalformedRequestsGetAnErrorAndChangeNothing) {
   EXPECT_EQ(Stop(), 0);
 }
 
+TEST_F(ServiceHostTest, ASilentClientCannotHoldOffOthers) {
+  std::string error;
+  const int silent = slcproto::Connect(sock_, &error);
+  ASSERT_GE(silent, 0) << error;
+  const auto start = std::chrono::steady_clock::now();
+  Message hello, reply;
+  hello.type = Type::kHello;
+  ASSERT_TRUE(slcproto::Call(sock_, hello, &reply, &error, 15000)) << error;
+  EXPECT_TRUE(reply.args.value("ok", false));
+  EXPECT_LT(std::chrono::steady_clock::now() - start, std::chrono::seconds(10));
+  close(silent);
+}
+
 TEST_F(ServiceHostTest, AgentsAreCreatedThroughTheCreateAgentProperty) {
   Message reply;
   ASSERT_TRUE(Request(Type::kCreateAgent, &reply, {{"text", "second:default-action=ACTION_DROP"}}));
