@@ -125,7 +125,6 @@ class SlowPathHub : public host::SlowPathBackend {
 
   WithPortFn withPort_;
   std::mutex mu_;
-  std::condition_variable quietCv_;
   std::map<uint32_t, std::shared_ptr<Link>> links_;    // live and being torn down
   std::map<host::FilterId, int64_t> lastRestore_;
   uint32_t nextId_ = 1;
