@@ -286,6 +286,9 @@ void SlowPathHub::Teardown(const std::shared_ptr<Link>& link) {
     link->closing = true;
   }
   link->qcv.notify_all();
+  // A process that stopped reading would hold the writer in send() for
+  // ever; nothing queued for a dead link matters any more.
+  ::shutdown(link->fd, SHUT_RDWR);
   if (link->writer.joinable()) link->writer.join();
   {
     // Under the lock: Shutdown must not shut down a number reused since.
