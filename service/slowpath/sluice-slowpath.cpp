@@ -549,9 +549,11 @@ int main(int argc, char** argv) {
                  "FILTER=FILE: push this ruleset when FILTER is first attached (repeatable)");
   app.add_flag("--refuse-restore", o.refuseRestore,
                "answer every state restore with a failure (to see the host's failure path)");
-  app.add_flag("!--no-commands", o.commands, "do not read commands from stdin");
+  bool noCommands = false;
+  app.add_flag("--no-commands", noCommands, "do not read commands from stdin");
   app.add_option("--max-seconds", o.maxSeconds, "stop by itself after this long (0: never)");
   CLI11_PARSE(app, argc, argv);
+  o.commands = !noCommands;
 
   struct sigaction sa {};
   sa.sa_handler = OnStop;
