@@ -240,6 +240,16 @@ sp_cmd b1 counts
 check "B's slow path counts continue from A's" \
   wait_for "$DIR/b1.out" "counts vm1 from-switch=0 to-switch=$((SP_BEFORE + 5)) "
 
+# --- a slow path that does not answer the fetch --------------------------------
+kill -STOP "$SP_b1"
+ctl B migrate vm1 --to "$DIR/A.sock" >"$DIR/m0.out" 2>&1
+M0=$?
+kill -CONT "$SP_b1"
+check "a silent slow path fails the migration after its time-out" \
+  test $M0 -ne 0 -a "$(ports_of B)" = "vm1"
+check "the refusal says the state was not saved" grep -q "saved-state length: 0xbad0001" "$DIR/m0.out"
+check "the port carries on at the source" test "$(traffic_round "$Q")" = "4 0 5"
+
 # --- a restore whose slow path part cannot be delivered -----------------------
 kill -TERM "$SP_a2"; wait "$SP_a2" 2>/dev/null
 for _ in $(seq 30); do [ "$(slowpaths_of A)" = "none" ] && break; sleep 0.1; done
