@@ -58,6 +58,15 @@ wait_for() {  # wait_for FILE PATTERN
   done
   return 1
 }
+# Waits up to 5 s for at least N lines matching PATTERN in FILE.
+wait_for_n() {  # wait_for_n FILE PATTERN N
+  local i
+  for i in $(seq 50); do
+    [ "$(grep -c -- "$2" "$1" 2>/dev/null)" -ge "$3" ] && return 0
+    sleep 0.1
+  done
+  return 1
+}
 # Sends COUNT one-line UDP datagrams from namespace NS to ADDR:PORT.
 send_udp() {  # send_udp NS ADDR PORT COUNT [GAP_SECONDS]
   ip netns exec "$1" python3 -c '
@@ -190,6 +199,21 @@ check "rules read back over the filter-ioctl channel" wait_for "$DIR/a1.out" "ru
 check "rule counters equal what was sent" test "$(rule_counts A)" = "4 3 5"
 stats_show_link() { ctl A stats | grep -q "slow path #1 a1 (agent fw): filters \[vm1\], punted 5 (dropped 0), sent back 5"; }
 check "stats show the link and what passed over it" stats_show_link
+
+# A copy goes to the slow path while the original goes on; this slow path
+# sends its copy back too.
+echo "action=copy ipv4 proto=udp dport=5200" >"$DIR/copy.txt"
+sp_cmd a1 "push vm1 $DIR/copy.txt"
+check "copy rule pushed" wait_for_n "$DIR/a1.out" "push vm1 status=1" 2
+recv_udp "$P-net" 5200 "$DIR/c5200"; C1=$LAST_RECV
+sleep 0.3
+send_udp "$P-vm" 10.77.0.2 5200 3
+sleep 0.5
+kill $C1 2>/dev/null; wait $C1 2>/dev/null
+check "copies reach the slow path" test "$(grep -c "packet vm1 dir=2" "$DIR/a1.out")" -eq 8
+check "originals and returned copies arrive" test "$(lines "$DIR/c5200")" -eq 6
+sp_cmd a1 "push vm1 $DIR/rules.txt"
+check "rules pushed back" wait_for_n "$DIR/a1.out" "push vm1 status=1" 3
 
 # --- killing a slow path mid-stream loses nothing the rules accept ------------
 start_sp a2 A --reissue
