@@ -31,6 +31,9 @@ have_cmd ethtool || need+=(ethtool)
 have_cmd socat || need+=(socat)
 have_cmd tcpdump || need+=(tcpdump)
 have_cmd python3 || need+=(python3)
+# sluice-slowpath writes its captures with libpcap.
+have_pkg libpcap-dev || need+=(libpcap-dev)
+have_cmd pkg-config || need+=(pkg-config)
 
 case "${1:-}" in
   bench)

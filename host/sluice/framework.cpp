@@ -140,7 +140,8 @@ void SluiceLeftovers(std::vector<std::string>* out) {
     out->push_back("sluice: filter " + std::to_string(id) + " '" + f->config.name +
                    "' of agent '" + f->agent->name + "' alive");
   }
-  size_t pending = S().deferred.size() + S().threaded.size() + S().inFlight;
+  size_t pending = S().deferred.size() + S().threaded.size() + S().inFlight +
+                   S().backendRequests.size();
   if (pending != 0) {
     out->push_back("sluice: " + std::to_string(pending) + " request replies pending");
   }
@@ -353,16 +354,27 @@ ZelStatus TakeOver(ZelSluiceFilterHandle filter, ZelPktList* list, uint32_t dire
                    const char* call, bool faulted, const void* site) {
   ZelStatus injected = Faults::Check(call, site);
   std::vector<ZelPkt*> pkts;
+  SlowPathBackend* backend = nullptr;
+  FilterId id = 0;
+  uint32_t slowPath = 0;
   {
     std::lock_guard<std::mutex> g(S().mu);
     ZelSluiceFilter* f = FilterLocked(filter, call);
     if (list == nullptr) return ZEL_BAD_PARAM;
     pkts = TakePackets(list);
-    if (injected == ZEL_OK) {
+    if (injected == ZEL_OK && faulted && S().backend != nullptr && f->slowPath != 0) {
+      backend = S().backend;
+      id = f->id;
+      slowPath = f->slowPath;
+    } else if (injected == ZEL_OK) {
       auto& to = faulted ? f->faulted : f->issued;
       to.push_back(Delivery{direction, std::move(pkts)});
       return ZEL_OK;
     }
+  }
+  if (backend != nullptr) {
+    backend->Faulted(id, slowPath, direction, std::move(pkts));
+    return ZEL_OK;
   }
   // The framework takes the packets over even when it fails the call: they
   // are dropped, as the caller may no longer touch them.
@@ -615,6 +627,15 @@ ZelStatus Sluice::UnregisterSlowPath(std::string_view agent, uint32_t slowPathId
   return s;
 }
 
+std::vector<uint32_t> Sluice::SlowPaths(std::string_view agent) {
+  std::lock_guard<std::mutex> g(S().mu);
+  std::vector<uint32_t> out;
+  if (ZelSluiceFastPath* a = AgentByNameLocked(agent)) {
+    for (auto& sp : a->slowPaths) out.push_back(sp.first);
+  }
+  return out;
+}
+
 void Sluice::SlowPathIoctl(std::string_view agent, uint32_t slowPathId, uint32_t code,
                            std::vector<uint8_t> payload) {
   const ZelSluiceFastPathOps* ops;
@@ -650,6 +671,55 @@ void Sluice::SendIoctl(FilterId id, uint32_t requestCode, std::vector<uint8_t> p
 std::vector<IoctlReplyRecord> Sluice::TakeIoctlReplies(FilterId id) {
   std::lock_guard<std::mutex> g(S().mu);
   return std::exchange(FilterByIdLocked(id, "TakeIoctlReplies")->ioctlReplies, {});
+}
+
+}  // namespace host
+
+// ---------------------------------------------------------------------------
+// Migration: the framework's save and restore calls
+
+namespace host {
+
+namespace {
+
+template <typename Fn>
+auto WithFilterOps(FilterId id, const char* call, Fn fn) {
+  void* priv;
+  const ZelSluiceFastPathOps* ops;
+  {
+    std::lock_guard<std::mutex> g(S().mu);
+    ZelSluiceFilter* f = LiveFilterByIdLocked(id, call);
+    priv = f->priv;
+    ops = f->agent->ops;
+  }
+  return fn(ops, priv);
+}
+
+}  // namespace
+
+void Sluice::PrefetchSavedState(FilterId id) {
+  WithFilterOps(id, "PrefetchSavedState", [](const ZelSluiceFastPathOps* ops, void* priv) {
+    if (ops->prefetchSavedState != nullptr) ops->prefetchSavedState(priv);
+  });
+}
+
+ZelStatus Sluice::GetSavedStateLen(FilterId id, uint64_t* len) {
+  return WithFilterOps(id, "GetSavedStateLen", [&](const ZelSluiceFastPathOps* ops, void* priv) {
+    return ops->getSavedStateLen != nullptr ? ops->getSavedStateLen(priv, len)
+                                            : ZEL_NOT_SUPPORTED;
+  });
+}
+
+ZelStatus Sluice::SaveState(FilterId id, void* buf, uint64_t* len) {
+  return WithFilterOps(id, "SaveState", [&](const ZelSluiceFastPathOps* ops, void* priv) {
+    return ops->saveState != nullptr ? ops->saveState(priv, buf, len) : ZEL_NOT_SUPPORTED;
+  });
+}
+
+ZelStatus Sluice::RestoreState(FilterId id, const void* buf, uint64_t len) {
+  return WithFilterOps(id, "RestoreState", [&](const ZelSluiceFastPathOps* ops, void* priv) {
+    return ops->restoreState != nullptr ? ops->restoreState(priv, buf, len) : ZEL_NOT_SUPPORTED;
+  });
 }
 
 }  // namespace host

@@ -68,6 +68,38 @@ struct RequestRecord {
   ZelStatus result = ZEL_OK;         // what the call returned
 };
 
+// A slow path that lives outside the framework (a process on the other end
+// of a socket). While one is installed, the framework hands it the set,
+// retrieve and restore requests the module makes, tells it of cleared
+// attachments and gives it the packets the module faults; test policies then
+// apply only to filter ioctl requests.
+struct SlowPathRequest {
+  RequestKind kind = RequestKind::SetSlowPath;
+  uint64_t token = 0;             // names the request in Sluice::CompleteRequest
+  FilterId filter = 0;
+  std::string filterName;
+  uint32_t slowPathId = 0;        // set: the one asked for; else the filter's own
+  uint32_t timeoutMs = 0;
+  std::vector<uint8_t> data;      // restore: the slow path's saved bytes
+};
+
+class SlowPathBackend {
+ public:
+  virtual ~SlowPathBackend() = default;
+  // Called without framework locks, possibly from inside a module callback.
+  // A non-zero status refuses the request (the module gets it, no reply
+  // follows). ZEL_OK obliges the backend to call Sluice::CompleteRequest
+  // exactly once for the token, from a thread that holds none of the
+  // backend's own locks (the module's reply may make a new request at once).
+  virtual ZelStatus Request(SlowPathRequest request) = 0;
+  // zel_SluiceClearSlowPath succeeded for the filter (synchronous, no reply).
+  virtual void Cleared(FilterId filter, uint32_t slowPathId) = 0;
+  // Faulted packets of a filter attached to `slowPathId`; the backend owns
+  // them and must release each. Called from inside the packet callback.
+  virtual void Faulted(FilterId filter, uint32_t slowPathId, uint32_t direction,
+                       std::vector<ZelPkt*> packets) = 0;
+};
+
 struct IoctlReplyRecord {
   uint32_t requestCode = 0;
   std::vector<uint8_t> message;
@@ -119,6 +151,7 @@ class Sluice {
   static ZelStatus RegisterSlowPath(std::string_view agent, uint32_t slowPathId);
   // One call of the unregister callback; on ZEL_OK the slow path is forgotten.
   static ZelStatus UnregisterSlowPath(std::string_view agent, uint32_t slowPathId);
+  static std::vector<uint32_t> SlowPaths(std::string_view agent);
   static void SlowPathIoctl(std::string_view agent, uint32_t slowPathId, uint32_t code,
                             std::vector<uint8_t> payload);
 
@@ -137,6 +170,22 @@ class Sluice {
   static void WaitReplies();
   static std::vector<RequestRecord> Requests(RequestKind kind);
   static void ClearRequests();
+
+  // --- an outside slow path ---
+  // Installs (or, with null, removes) the backend. Removing it while
+  // requests are outstanding aborts: complete them first.
+  static void SetSlowPathBackend(SlowPathBackend* backend);
+  // Delivers the one reply of an accepted backend request: the status, and
+  // for a retrieve the slow path's bytes. False for an unknown token.
+  static bool CompleteRequest(uint64_t token, ZelStatus status, std::vector<uint8_t> data = {});
+  // Backend requests accepted and not yet completed, for one filter or all.
+  static size_t OutstandingBackendRequests(FilterId filter = 0);
+
+  // --- migration (the framework's save and restore calls) ---
+  static void PrefetchSavedState(FilterId id);
+  static ZelStatus GetSavedStateLen(FilterId id, uint64_t* len);
+  static ZelStatus SaveState(FilterId id, void* buf, uint64_t* len);
+  static ZelStatus RestoreState(FilterId id, const void* buf, uint64_t len);
 
   // --- filter ioctl channel (slow path side) ---
   static void SendIoctl(FilterId id, uint32_t requestCode, std::vector<uint8_t> payload);

@@ -91,38 +91,66 @@ void WithReplyBuffer(const std::vector<uint8_t>& data, Fn fn) {
 // Records the request and refuses it or arranges its one reply, as the
 // policy of its kind says. `badArgs` non-zero refuses it before that (after
 // the handle check). `makeCall` turns the policy into the reply call.
-template <typename MakeCall>
+//
+// With a slow path backend installed, set, retrieve and restore requests go
+// to it instead (not recorded: a long-running host would keep them forever);
+// `makeBackendCall` gives the reply call that CompleteRequest makes.
+template <typename MakeCall, typename MakeBackendCall>
 ZelStatus Submit(const char* call, ZelSluiceFilterHandle filter, ZelStatus badArgs,
-                 RequestRecord record, MakeCall makeCall) {
+                 RequestRecord record, MakeCall makeCall, MakeBackendCall makeBackendCall) {
   PendingReply r;
+  SlowPathBackend* backend = nullptr;
+  SlowPathRequest out;
   {
     std::lock_guard<std::mutex> g(S().mu);
     ZelSluiceFilter* f = FilterLocked(filter, call);
     if (badArgs != ZEL_OK) return badArgs;
-    const RequestPolicy& policy = PolicyLocked(record.kind);
-    record.filter = f->id;
-    record.result = policy.refuse;
-    r.kind = record.kind;
-    r.slowPathId = record.slowPathId;
-    S().requests[record.kind].push_back(std::move(record));
-    if (policy.refuse != ZEL_OK) return policy.refuse;
+    if (S().backend != nullptr && record.kind != RequestKind::IoctlRequest) {
+      backend = S().backend;
+      out.kind = record.kind;
+      out.token = S().nextSeq++;
+      out.filter = f->id;
+      out.filterName = f->config.name;
+      out.slowPathId = record.kind == RequestKind::SetSlowPath ? record.slowPathId : f->slowPath;
+      out.timeoutMs = record.timeoutMs;
+      out.data = std::move(record.data);
+      S().backendRequests[out.token] =
+          BackendRequest{record.kind, f, out.slowPathId, makeBackendCall()};
+    } else {
+      const RequestPolicy& policy = PolicyLocked(record.kind);
+      record.filter = f->id;
+      record.result = policy.refuse;
+      r.kind = record.kind;
+      r.slowPathId = record.slowPathId;
+      S().requests[record.kind].push_back(std::move(record));
+      if (policy.refuse != ZEL_OK) return policy.refuse;
 
-    r.seq = S().nextSeq++;
-    r.filter = f;
-    r.status = policy.replyStatus;
-    r.call = makeCall(policy);
-    switch (policy.mode) {
-      case ReplyMode::Inline:
-        break;
-      case ReplyMode::Deferred:
-        S().deferred.push_back(std::move(r));
-        return ZEL_OK;
-      case ReplyMode::OtherThread:
-        if (!S().worker.joinable()) S().worker = std::thread(ReplyThread);
-        S().threaded.push_back(std::move(r));
-        S().workCv.notify_one();
-        return ZEL_OK;
+      r.seq = S().nextSeq++;
+      r.filter = f;
+      r.status = policy.replyStatus;
+      r.call = makeCall(policy);
+      switch (policy.mode) {
+        case ReplyMode::Inline:
+          break;
+        case ReplyMode::Deferred:
+          S().deferred.push_back(std::move(r));
+          return ZEL_OK;
+        case ReplyMode::OtherThread:
+          if (!S().worker.joinable()) S().worker = std::thread(ReplyThread);
+          S().threaded.push_back(std::move(r));
+          S().workCv.notify_one();
+          return ZEL_OK;
+      }
     }
+  }
+  if (backend != nullptr) {
+    const uint64_t token = out.token;
+    const ZelStatus s = backend->Request(std::move(out));
+    if (s != ZEL_OK) {
+      std::lock_guard<std::mutex> g(S().mu);
+      S().backendRequests.erase(token);
+    }
+    return s;
   }
   if (++inlineDepth > kMaxInlineDepth) {
     Fatal("%s: inline replies nested %d deep; the module keeps re-requesting from its reply "
@@ -143,6 +171,7 @@ size_t QueuedRepliesLocked(const ZelSluiceFilter* filter) {
       return r.filter == filter;
     });
   }
+  for (const auto& [token, b] : S().backendRequests) n += b.filter == filter ? 1 : 0;
   return n;
 }
 
@@ -157,6 +186,8 @@ void ResetRequestsLocked() {
   S().clearAnswers.clear();
   S().requests.clear();
   S().deferred.clear();
+  S().backend = nullptr;
+  S().backendRequests.clear();
   S().nextSeq = 1;
   S().idleCv.notify_all();
 }
@@ -188,20 +219,35 @@ ZelStatus zel_SluiceSetSlowPath(ZelSluiceFilterHandle filter, uint32_t slowPathI
                   return [reply, cookie, status = p.replyStatus](void* priv) {
                     reply(priv, cookie, status);
                   };
+                },
+                [&] {
+                  return [reply, cookie](void* priv, ZelStatus status, const std::vector<uint8_t>&) {
+                    reply(priv, cookie, status);
+                  };
                 });
 }
 
 ZelStatus zel_SluiceClearSlowPath(ZelSluiceFilterHandle filter) {
   if (ZelStatus s = Faults::Check("zel_SluiceClearSlowPath")) return s;
-  std::lock_guard<std::mutex> g(S().mu);
-  ZelSluiceFilter* f = FilterLocked(filter, "zel_SluiceClearSlowPath");
-  f->clearCalls++;
+  SlowPathBackend* backend = nullptr;
+  FilterId id = 0;
+  uint32_t was = 0;
   ZelStatus answer = ZEL_OK;
-  if (!S().clearAnswers.empty()) {
-    answer = S().clearAnswers.front();
-    S().clearAnswers.pop_front();
+  {
+    std::lock_guard<std::mutex> g(S().mu);
+    ZelSluiceFilter* f = FilterLocked(filter, "zel_SluiceClearSlowPath");
+    f->clearCalls++;
+    if (!S().clearAnswers.empty()) {
+      answer = S().clearAnswers.front();
+      S().clearAnswers.pop_front();
+    }
+    if (answer == ZEL_OK) {
+      backend = S().backend;
+      id = f->id;
+      was = std::exchange(f->slowPath, 0);
+    }
   }
-  if (answer == ZEL_OK) f->slowPath = 0;
+  if (backend != nullptr && was != 0) backend->Cleared(id, was);
   return answer;
 }
 
@@ -216,6 +262,14 @@ ZelStatus zel_SluiceRetrieveSlowPathState(ZelSluiceFilterHandle filter,
                 reply == nullptr ? ZEL_BAD_PARAM : ZEL_OK, std::move(rec),
                 [&](const RequestPolicy& p) {
                   return [reply, cookie, status = p.replyStatus, data = p.replyData](void* priv) {
+                    WithReplyBuffer(data, [&](const uint8_t* buf) {
+                      reply(priv, cookie, buf, data.size(), status);
+                    });
+                  };
+                },
+                [&] {
+                  return [reply, cookie](void* priv, ZelStatus status,
+                                         const std::vector<uint8_t>& data) {
                     WithReplyBuffer(data, [&](const uint8_t* buf) {
                       reply(priv, cookie, buf, data.size(), status);
                     });
@@ -240,6 +294,11 @@ ZelStatus zel_SluiceRestoreSlowPathState(ZelSluiceFilterHandle filter, const voi
                   return [reply, cookie, status = p.replyStatus](void* priv) {
                     reply(priv, cookie, status);
                   };
+                },
+                [&] {
+                  return [reply, cookie](void* priv, ZelStatus status, const std::vector<uint8_t>&) {
+                    reply(priv, cookie, status);
+                  };
                 });
 }
 
@@ -262,6 +321,9 @@ ZelStatus zel_SluiceSendFilterIoctlRequest(ZelSluiceFilterHandle filter, const v
                       reply(priv, cbData, buf, static_cast<uint32_t>(data.size()), status);
                     });
                   };
+                },
+                [] {
+                  return std::function<void(void*, ZelStatus, const std::vector<uint8_t>&)>{};
                 });
 }
 
@@ -314,6 +376,45 @@ size_t Sluice::ReleaseReplies(RequestKind kind, size_t n) {
 }
 
 void Sluice::WaitReplies() { DrainThreadedReplies(); }
+
+void Sluice::SetSlowPathBackend(SlowPathBackend* backend) {
+  std::lock_guard<std::mutex> g(S().mu);
+  if (backend == nullptr && !S().backendRequests.empty()) {
+    Fatal("Sluice::SetSlowPathBackend: removed with %zu requests outstanding",
+          S().backendRequests.size());
+  }
+  S().backend = backend;
+}
+
+bool Sluice::CompleteRequest(uint64_t token, ZelStatus status, std::vector<uint8_t> data) {
+  BackendRequest b;
+  void* priv;
+  {
+    std::lock_guard<std::mutex> g(S().mu);
+    auto it = S().backendRequests.find(token);
+    if (it == S().backendRequests.end()) return false;
+    b = std::move(it->second);
+    S().backendRequests.erase(it);
+    if (!b.filter->alive) {
+      Fatal("%s reply for filter %llu '%s' is due after the filter was destroyed",
+            KindName(b.kind), static_cast<unsigned long long>(b.filter->id),
+            b.filter->config.name.c_str());
+    }
+    priv = b.filter->priv;
+    if (b.kind == RequestKind::SetSlowPath && status == ZEL_OK) b.filter->slowPath = b.slowPathId;
+  }
+  b.call(priv, status, data);
+  return true;
+}
+
+size_t Sluice::OutstandingBackendRequests(FilterId filter) {
+  std::lock_guard<std::mutex> g(S().mu);
+  size_t n = 0;
+  for (const auto& [token, b] : S().backendRequests) {
+    n += filter == 0 || b.filter->id == filter ? 1 : 0;
+  }
+  return n;
+}
 
 std::vector<RequestRecord> Sluice::Requests(RequestKind kind) {
   std::lock_guard<std::mutex> g(S().mu);

@@ -66,8 +66,19 @@ struct PendingReply {
   std::function<void(void* filterPriv)> call;
 };
 
+// A request handed to the slow path backend, waiting for CompleteRequest.
+struct BackendRequest {
+  RequestKind kind = RequestKind::SetSlowPath;
+  ZelSluiceFilter* filter = nullptr;
+  uint32_t slowPathId = 0;
+  std::function<void(void* filterPriv, ZelStatus status, const std::vector<uint8_t>& data)> call;
+};
+
 struct State {
   std::mutex mu;
+
+  SlowPathBackend* backend = nullptr;
+  std::map<uint64_t, BackendRequest> backendRequests;   // by token
 
   std::vector<std::unique_ptr<ZelSluiceFastPath>> agents;   // registered, in order
   std::vector<std::unique_ptr<ZelSluiceFastPath>> deadAgents;

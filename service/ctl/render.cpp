@@ -56,6 +56,18 @@ std::string RenderStats(const nlohmann::json& s) {
       out += fmt::format("  {}: {}\n", k, Str(v));
     }
   }
+  for (const auto& sp : s.value("slowPaths", nlohmann::json::array())) {
+    auto field = [&](const char* k) { return Str(sp.value(k, nlohmann::json(""))); };
+    std::string filters;
+    for (const auto& f : sp.value("filters", nlohmann::json::array())) {
+      filters += (filters.empty() ? "" : ", ") + Str(f);
+    }
+    out += fmt::format(
+        "slow path #{} {} (agent {}): filters [{}], punted {} (dropped {}), sent back {}, "
+        "ioctls {}\n",
+        field("id"), field("name"), field("agent"), filters, field("punted"),
+        field("puntDropped"), field("reissued"), field("ioctls"));
+  }
   return out;
 }
 

@@ -167,6 +167,16 @@ int main(int argc, char** argv) {
   status->add_option("--agent", agentArg, "only this agent");
   status->add_option("--max-rules", maxRules, "rules shown per filter")->capture_default_str();
 
+  auto* migrate = app.add_subcommand(
+      "migrate",
+      "move a port's filter (rules, counters, slow path state) to another sluice-host");
+  std::string migrateTo, migrateVm, migrateSwitch;
+  migrate->add_option("port", portName, "port (filter) name")->required();
+  migrate->add_option("--to", migrateTo, "the destination host's control socket")->required();
+  migrate->add_option("--vm", migrateVm, "VM-side interface there (default: the same name)");
+  migrate->add_option("--switch", migrateSwitch,
+                      "switch-side interface there (default: the same name)");
+
   CLI11_PARSE(app, argc, argv);
 
   Message reply;
@@ -245,6 +255,14 @@ int main(int argc, char** argv) {
     if (!agentArg.empty()) req.args["agent"] = agentArg;
   }
 
+  if (*migrate) {
+    req.type = Type::kMigrateOut;
+    req.args["port"] = portName;
+    req.args["to"] = migrateTo;
+    if (!migrateVm.empty()) req.args["vm"] = migrateVm;
+    if (!migrateSwitch.empty()) req.args["switch"] = migrateSwitch;
+  }
+
   rc = Call(c, req, &reply);
   if (rc != 0) return rc;
 
@@ -271,6 +289,12 @@ int main(int argc, char** argv) {
   } else if (*hello) {
     std::printf("%s pid %s, protocol %s\n", body.value("host", std::string()).c_str(),
                 body["pid"].dump().c_str(), body["protocol"].dump().c_str());
+  } else if (*migrate) {
+    const nlohmann::json dest = body.value("destination", nlohmann::json::object());
+    std::printf("migrated %s: %s bytes saved (rules %s, slow path %s), slow path state %s\n",
+                portName.c_str(), body["savedBytes"].dump().c_str(),
+                body["fastPathBytes"].dump().c_str(), body["slowPathBytes"].dump().c_str(),
+                dest.value("slowPathState", std::string("unknown")).c_str());
   } else if (*devSet || *devTest) {
     std::printf("done (result %s)\n", body["result"].dump().c_str());
   } else {

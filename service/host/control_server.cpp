@@ -114,6 +114,7 @@ bool ControlServer::Start(const std::string& path, std::string* error) {
   }
   path_ = path;
   stop_ = false;
+  hub_.Install();
   thread_ = std::thread([this] { Serve(); });
   return true;
 }
@@ -121,6 +122,9 @@ bool ControlServer::Start(const std::string& path, std::string* error) {
 void ControlServer::Stop() {
   stop_ = true;
   if (thread_.joinable()) thread_.join();
+  // Slow paths go before the ports: their filters detach while the links
+  // can still answer.
+  hub_.Shutdown();
   if (listenFd_ >= 0) {
     close(listenFd_);
     listenFd_ = -1;
@@ -170,6 +174,16 @@ void ControlServer::ServeConnection(int fd) {
       // After a bad header or a short body the stream cannot be trusted to
       // find the next message: answer and hang up.
       if (error != "end of stream") (void)slcproto::WriteMessage(fd, Fail(error), &error);
+      return;
+    }
+    if (req.type == Type::kSpRegister) {
+      // The connection now belongs to the slow-path link.
+      const int kept = dup(fd);
+      if (kept < 0) {
+        (void)slcproto::WriteMessage(fd, Fail("cannot keep the connection"), &error);
+        return;
+      }
+      hub_.Adopt(kept, req);
       return;
     }
     Message reply;
@@ -243,6 +257,14 @@ bool ControlServer::CloseAllPorts() {
   for (auto& [name, port] : ports_) ok = port->Close() && ok;
   if (ok) ports_.clear();
   return ok;
+}
+
+bool ControlServer::WithPort(const std::string& name, const std::function<void(Port&)>& fn) {
+  std::lock_guard<std::mutex> g(mu_);
+  auto it = ports_.find(name);
+  if (it == ports_.end()) return false;
+  fn(*it->second);
+  return true;
 }
 
 bool ControlServer::FindPort(const nlohmann::json& args, std::string* agent, host::FilterId* id,
@@ -471,6 +493,7 @@ Message ControlServer::Stats() {
     }
   }
   m.args["ports"] = std::move(ports);
+  m.args["slowPaths"] = hub_.Stats();
   return m;
 }
 
@@ -521,6 +544,10 @@ Message ControlServer::Handle(const Message& req) {
       return Device(req);
     case Type::kStatus:
       return Status(req);
+    case Type::kMigrateOut:
+      return MigrateOut(req);
+    case Type::kMigrateIn:
+      return MigrateIn(req);
     default:
       return Fail("unknown request type " + std::to_string(static_cast<unsigned>(req.type)));
   }

@@ -3,6 +3,9 @@
 // credentials), reads length-bounded requests and answers each through the
 // module's own channel for it: the create-agent property, the agent's
 // ruleset property, the agent's character device and the status tree.
+// A connection that opens with kSpRegister is a slow path: it is handed to
+// the slow-path hub for the rest of its life. Migration requests move a
+// port's filter to or from another host (migration.cpp).
 #pragma once
 
 #include <atomic>
@@ -14,6 +17,7 @@
 #include <thread>
 
 #include "service/host/ports.h"
+#include "service/host/slowpath_hub.h"
 #include "service/protocol/protocol.h"
 
 namespace service {
@@ -51,6 +55,9 @@ class ControlServer {
   slcproto::Message Device(const slcproto::Message& req);
   slcproto::Message Status(const slcproto::Message& req);
   slcproto::Message Stats();
+  slcproto::Message MigrateOut(const slcproto::Message& req);
+  slcproto::Message MigrateIn(const slcproto::Message& req);
+  bool WithPort(const std::string& name, const std::function<void(Port&)>& fn);
 
   std::string path_;
   int listenFd_ = -1;
@@ -58,6 +65,9 @@ class ControlServer {
   std::thread thread_;
   std::mutex mu_;  // ports_
   std::map<std::string, std::unique_ptr<Port>> ports_;
+  SlowPathHub hub_{[this](const std::string& name, const std::function<void(Port&)>& fn) {
+    return WithPort(name, fn);
+  }};
 };
 
 }  // namespace service

@@ -194,7 +194,7 @@ bool PortSpecFromJson(const nlohmann::json& j, PortSpec* out, std::string* error
   return true;
 }
 
-std::unique_ptr<Port> Port::Open(const PortSpec& spec, std::string* error) {
+std::unique_ptr<Port> Port::Open(const PortSpec& spec, std::string* error, bool start) {
   std::unique_ptr<Port> port(new Port);
   port->spec_ = spec;
   port->fd_[1] = OpenInterface(spec.switchIf, error);
@@ -226,20 +226,39 @@ std::unique_ptr<Port> Port::Open(const PortSpec& spec, std::string* error) {
     port->filter_ = 0;
     return nullptr;
   }
-  for (int side : {1, 2}) {
-    Port* p = port.get();
-    port->readers_[side] = port->ring_[side].map != nullptr
-                               ? std::thread([p, side] { p->RingReader(side); })
-                               : std::thread([p, side] { p->Reader(side); });
-  }
+  if (start) port->StartReaders();
   return port;
 }
 
-bool Port::Close(int waitMs) {
+void Port::StartReaders() {
+  StopReaders();
+  stop_ = false;
+  for (int side : {1, 2}) {
+    readers_[side] = ring_[side].map != nullptr ? std::thread([this, side] { RingReader(side); })
+                                                : std::thread([this, side] { Reader(side); });
+  }
+}
+
+void Port::StopReaders() {
   stop_ = true;
   for (int side : {1, 2}) {
     if (readers_[side].joinable()) readers_[side].join();
   }
+}
+
+size_t Port::FromSlowPath(const std::vector<std::vector<uint8_t>>& frames, uint32_t direction) {
+  host::PacketList list;
+  for (const auto& f : frames) list.Append(host::Packets::Make(f));
+  (void)host::Sluice::DeliverFromSlowPath(filter_, list, direction);
+  // What the callback left in the list continues the way it was going.
+  Transmit(fd_[direction == 1 ? 2 : 1], list, direction);
+  if (host::Sluice::IssuedCount(filter_) > 0) TransmitDeliveries(host::Sluice::TakeIssued(filter_));
+  counters_.fromSlowPath += frames.size();
+  return frames.size();
+}
+
+bool Port::Close(int waitMs) {
+  StopReaders();
   if (filter_ == 0) return true;
   const auto deadline = std::chrono::steady_clock::now() + std::chrono::milliseconds(waitMs);
   for (;;) {
@@ -276,6 +295,7 @@ nlohmann::json Port::Stats() const {
           {"txToSwitch", c.tx[2].load()},
           {"turnedBack", c.turnedBack.load()},
           {"slowPath", c.slowPath.load()},
+          {"fromSlowPath", c.fromSlowPath.load()},
           {"oversize", c.oversize.load()},
           {"txErrors", c.txErrors.load()},
           {"batches", c.batches.load()},
@@ -327,12 +347,13 @@ void Port::Transmit(int fd, host::PacketList& list, uint32_t direction) {
   }
 }
 
-void Port::TransmitDeliveries(int fd, std::vector<host::Delivery> deliveries, uint32_t direction) {
+void Port::TransmitDeliveries(std::vector<host::Delivery> deliveries) {
   for (auto& d : deliveries) {
-    counters_.turnedBack += d.packets.size();
+    const uint32_t direction = d.direction == 1 ? 1 : 2;
+    if (direction == 2) counters_.turnedBack += d.packets.size();
     host::PacketList list;
     for (ZelPkt* p : d.packets) list.Append(p);
-    Transmit(fd, list, direction);
+    Transmit(fd_[direction == 1 ? 2 : 1], list, direction);
   }
 }
 
@@ -360,7 +381,7 @@ void Port::Process(int side, std::span<const RxFrame> frames) {
       std::chrono::duration_cast<std::chrono::nanoseconds>(std::chrono::steady_clock::now() - t2)
           .count());
   if (host::Sluice::IssuedCount(filter_) > 0) {
-    TransmitDeliveries(fd_[1], host::Sluice::TakeIssued(filter_), 2);
+    TransmitDeliveries(host::Sluice::TakeIssued(filter_));
   }
   if (host::Sluice::FaultedCount(filter_) > 0) {
     for (auto& d : host::Sluice::TakeFaulted(filter_)) {
@@ -402,8 +423,9 @@ void Port::Reader(int side) {
 // Walks the ring block by block: a block belongs to this thread from the
 // kernel's TP_STATUS_USER until it is handed back with TP_STATUS_KERNEL.
 void Port::RingReader(int side) {
-  const Ring& ring = ring_[side];
-  uint32_t current = 0;
+  Ring& ring = ring_[side];
+  // A restarted reader goes on with the block the kernel fills next.
+  uint32_t current = ring.next;
   RxFrame frames[kBatch];
   while (!stop_.load(std::memory_order_relaxed)) {
     auto* block =
@@ -435,6 +457,7 @@ void Port::RingReader(int side) {
     __atomic_store_n(&block->hdr.bh1.block_status, TP_STATUS_KERNEL, __ATOMIC_RELEASE);
     current = (current + 1) % ring.blocks;
   }
+  ring.next = current;
 }
 
 }  // namespace service

@@ -2,8 +2,9 @@
 // VM-side interface go to the filter as "to switch" (direction 2), frames
 // read on the switch side as "from switch" (direction 1), in lists of up to
 // kBatch; what the filter leaves in a list goes out on the other interface,
-// lists the filter turns back go out on the switch side, and lists for the
-// slow path are counted and released (no slow path is attached here).
+// lists the filter turns back go out on the side their direction leads to,
+// and lists for the slow path go to the slow path the filter is attached to
+// (or, with none, are counted and released).
 //
 // Interfaces are read through TPACKET_V3 receive rings on AF_PACKET sockets
 // in promiscuous mode (or recvmmsg where a ring cannot be set up) and
@@ -40,10 +41,11 @@ nlohmann::json PortSpecToJson(const PortSpec& spec);
 bool PortSpecFromJson(const nlohmann::json& j, PortSpec* out, std::string* error);
 
 struct PortCounters {
-  std::atomic<uint64_t> rx[3]{};        // by direction (1, 2)
-  std::atomic<uint64_t> tx[3]{};        // by direction of travel
-  std::atomic<uint64_t> turnedBack{0};  // issued toward the switch
-  std::atomic<uint64_t> slowPath{0};    // faulted, released
+  std::atomic<uint64_t> rx[3]{};          // by direction (1, 2)
+  std::atomic<uint64_t> tx[3]{};          // by direction of travel
+  std::atomic<uint64_t> turnedBack{0};    // issued toward the switch
+  std::atomic<uint64_t> slowPath{0};      // faulted with no slow path, released
+  std::atomic<uint64_t> fromSlowPath{0};  // handed back by a slow path
   std::atomic<uint64_t> oversize{0};
   std::atomic<uint64_t> txErrors{0};
   std::atomic<uint64_t> batches{0};
@@ -62,9 +64,17 @@ class Port {
   static constexpr uint32_t kFrameMax = 9216 + 18;
 
   // Opens both interfaces, creates the filter through the framework and
-  // starts one reader per side. Null with a reason on failure (nothing left
-  // behind).
-  static std::unique_ptr<Port> Open(const PortSpec& spec, std::string* error);
+  // (unless `start` is false) starts one reader per side. Null with a reason
+  // on failure (nothing left behind).
+  static std::unique_ptr<Port> Open(const PortSpec& spec, std::string* error, bool start = true);
+  // Starts or stops the readers; the filter stays. A stopped port takes no
+  // frames (a migrating VM is paused).
+  void StartReaders();
+  void StopReaders();
+  // Frames a slow path sends back: through the filter's slow-path packet
+  // callback, then out on the side `direction` leads to. Returns how many
+  // were handed to the filter.
+  size_t FromSlowPath(const std::vector<std::vector<uint8_t>>& frames, uint32_t direction);
   // Stops the readers, then destroys the filter, waiting out busy answers
   // (at most `waitMs`). False when the filter would not go.
   bool Close(int waitMs = 5000);
@@ -86,13 +96,15 @@ class Port {
     size_t mapLen = 0;
     uint32_t blockSize = 0;
     uint32_t blocks = 0;
+    uint32_t next = 0;   // the block to read next; kept while readers are stopped
   };
   void Reader(int side);
   void RingReader(int side);
   // Hands `frames` read on `side` to the filter and sends what it leaves.
   void Process(int side, std::span<const RxFrame> frames);
   void Transmit(int fd, host::PacketList& list, uint32_t direction);
-  void TransmitDeliveries(int fd, std::vector<host::Delivery> deliveries, uint32_t direction);
+  // Sends each delivery out on the side its direction leads to.
+  void TransmitDeliveries(std::vector<host::Delivery> deliveries);
 
   PortSpec spec_;
   host::FilterId filter_ = 0;

@@ -89,6 +89,11 @@ int main(int argc, char** argv) {
       "back go out on the switch side, GRE copies go through a raw socket and\n"
       "the kernel's routing. Senders should have checksum and segmentation\n"
       "offload off (ethtool -K IF tx off tso off gso off).\n\n"
+      "Slow paths (sluice-slowpath) register with an agent on the same socket;\n"
+      "punted packets go to the slow path a filter is attached to. When one\n"
+      "goes away its filters move to another or wait detached. 'sluice-ctl\n"
+      "migrate PORT --to SOCKET' moves a port's filter, with its rules,\n"
+      "counters and slow path state, to the sluice-host serving SOCKET.\n\n"
       "SIGTERM or SIGINT unloads the module; the exit status is 0 only when it\n"
       "left nothing behind (heap bytes, packets, timers, sockets).",
       "sluice-host"};

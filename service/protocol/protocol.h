@@ -54,10 +54,23 @@ enum class Type : uint16_t {
   kStatus = 0x010b,         // {path: [..]} -> {tree: ...}
   kStats = 0x010c,          // -> {heapBytes, heapBlocks, livePackets, timers}
 
-  // Reserved for the slow-path link and migration (not served yet).
+  // The slow-path link (service/protocol/slowpath_link.h says who sends
+  // which and which get no reply).
   kSlowPathFirst = 0x0200,
+  kSpRegister = 0x0200,     // sp -> host, first on the link: {agent, name} -> {id}
+  kSpAttach = 0x0201,       // host -> sp: {seq, filter, slowPath} -> {seq}
+  kSpDetach = 0x0202,       // host -> sp: {filter}; no reply
+  kSpFetchState = 0x0203,   // host -> sp: {seq, filter} -> {seq} + state blob
+  kSpRestoreState = 0x0204, // host -> sp: {seq, filter} + state blob -> {seq}
+  kSpPackets = 0x0205,      // host -> sp: {filter, direction, count} + frames; no reply
+  kSpReissue = 0x0206,      // sp -> host: {seq, filter, direction} + frames -> {seq, sent}
+  kSpIoctl = 0x0207,        // sp -> host: {seq, filter, code} + payload -> {seq, replies}
   kSlowPathLast = 0x02ff,
+
+  // Host-to-host migration.
   kMigrationFirst = 0x0300,
+  kMigrateOut = 0x0300,     // ctl -> source: {port, to[, vm, switch]} -> {savedBytes, ...}
+  kMigrateIn = 0x0301,      // source -> destination: {port: PortSpec} + saved state
   kMigrationLast = 0x03ff,
 };
 
