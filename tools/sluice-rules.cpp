@@ -11,6 +11,7 @@
 // and compile accept exactly the same texts.
 
 #include <CLI/CLI.hpp>
+#include <nlohmann/json.hpp>
 
 #include <cstdio>
 #include <fstream>
@@ -19,6 +20,7 @@
 
 #include "firewall/fw_trace.h"
 #include "tools/lib/capture.h"
+#include "tools/lib/render.h"
 #include "tools/lib/frames.h"
 #include "tools/lib/rule_analysis.h"
 #include "tools/lib/ruleset_builder.h"
@@ -29,6 +31,13 @@ namespace {
 // Rule texts and wire rulesets larger than this are refused before they are
 // read, so a hostile file cannot make the tool allocate without bound.
 constexpr uint64_t kMaxFileBytes = 256ull << 20;
+
+// With --json, check, lint and diff print one document on standard output
+// instead of text (schema 1, as every tool's JSON; see the README).
+bool gJson = false;
+nlohmann::json gDoc;
+
+void PrintJson() { std::printf("%s\n", gDoc.dump(2).c_str()); }
 
 bool ReadBounded(const std::string& path, std::string* out) {
   std::ifstream in(path, std::ios::binary | std::ios::ate);
@@ -67,7 +76,18 @@ bool Load(const std::string& path, rules::RulesetText* out) {
   }
   *out = rules::ReadRulesetText(data);
   if (!out->Ok()) {
-    std::fputs(rules::RenderDiagnostics(path, out->diagnostics).c_str(), stderr);
+    if (gJson) {
+      for (const rules::Diagnostic& d : out->diagnostics) {
+        gDoc["errors"].push_back({{"file", path},
+                                  {"line", d.line},
+                                  {"column", d.column},
+                                  {"message", d.message},
+                                  {"note", d.note}});
+      }
+      PrintJson();
+    } else {
+      std::fputs(rules::RenderDiagnostics(path, out->diagnostics).c_str(), stderr);
+    }
     return false;
   }
   return true;
@@ -116,6 +136,16 @@ int Check(const std::string& in, bool quiet) {
       exact++;
       if (r.rule.bidirectional == 1) mirrors++;
     }
+    if (gJson) {
+      nlohmann::json e = {{"line", r.line},
+                          {"table", why.empty() && !r.isDefault ? "exact" : "general"},
+                          {"action", rules::ActionName(r.rule.action)}};
+      if (!why.empty()) e["generalBecause"] = why;
+      if (why.empty() && r.rule.bidirectional == 1) e["mirrored"] = true;
+      if (r.isDefault) e["default"] = true;
+      gDoc["rules"].push_back(std::move(e));
+      continue;
+    }
     if (quiet) continue;
     std::string kind;
     if (r.isDefault) {
@@ -133,6 +163,16 @@ int Check(const std::string& in, bool quiet) {
     }
     std::printf("%s:%zu: %s\n", in.c_str(), r.line, kind.c_str());
   }
+  if (gJson) {
+    gDoc["file"] = in;
+    gDoc["version"] = text.version;
+    gDoc["counts"] = {{"rules", text.rules.size()},
+                      {"exact", exact},
+                      {"mirrored", mirrors},
+                      {"general", text.rules.size() - exact}};
+    PrintJson();
+    return 0;
+  }
   std::printf("%s: version %u, %zu rules: %zu exact (%zu mirrored), %zu general\n", in.c_str(),
               text.version, text.rules.size(), exact, mirrors, text.rules.size() - exact);
   return 0;
@@ -142,6 +182,17 @@ int Lint(const std::string& in) {
   rules::RulesetText text;
   if (!Load(in, &text)) return 1;
   const std::vector<rules::Finding> findings = rules::Lint(text);
+  if (gJson) {
+    gDoc["file"] = in;
+    gDoc["findings"] = nlohmann::json::array();
+    for (const rules::Finding& f : findings) {
+      nlohmann::json e = {{"line", f.line}, {"message", f.message}};
+      if (f.otherLine != 0) e["otherLine"] = f.otherLine;
+      gDoc["findings"].push_back(std::move(e));
+    }
+    PrintJson();
+    return findings.empty() ? 0 : 1;
+  }
   for (const rules::Finding& f : findings) {
     std::printf("%s:%zu: %s\n", in.c_str(), f.line, f.message.c_str());
   }
@@ -154,7 +205,22 @@ int Diff(const std::string& a, const std::string& b, const std::string& capture,
   rules::RulesetText oldText, newText;
   if (!Load(a, &oldText) || !Load(b, &newText)) return 2;
   const std::vector<rules::RuleChange> changes = rules::DiffRules(oldText, newText);
-  for (const rules::RuleChange& c : changes) {
+  if (gJson) {
+    gDoc["old"] = a;
+    gDoc["new"] = b;
+    gDoc["rules"] = nlohmann::json::array();
+    for (const rules::RuleChange& c : changes) {
+      nlohmann::json e = {{"change", c.kind == rules::RuleChange::kAdded     ? "added"
+                                     : c.kind == rules::RuleChange::kRemoved ? "removed"
+                                                                            : "changed"}};
+      if (c.oldLine != 0 || c.kind == rules::RuleChange::kRemoved) e["oldLine"] = c.oldLine;
+      if (c.newLine != 0 || c.kind == rules::RuleChange::kAdded) e["newLine"] = c.newLine;
+      if (c.kind != rules::RuleChange::kAdded) e["oldText"] = c.oldText;
+      if (c.kind != rules::RuleChange::kRemoved) e["newText"] = c.newText;
+      gDoc["rules"].push_back(std::move(e));
+    }
+  }
+  for (const rules::RuleChange& c : gJson ? std::vector<rules::RuleChange>{} : changes) {
     switch (c.kind) {
       case rules::RuleChange::kRemoved:
         std::printf("- %s:%zu: %s\n", a.c_str(), c.oldLine, c.oldText.c_str());
@@ -193,14 +259,36 @@ int Diff(const std::string& a, const std::string& b, const std::string& capture,
       std::fprintf(stderr, "sluice-rules: %s\n", error.c_str());
       return 2;
     }
-    for (const rules::VerdictChange& v : vc) {
+    auto verdictJson = [](const rules::PacketVerdict& v) {
+      nlohmann::json j = {{"decision", render::DecisionName(v.decision)},
+                          {"action", rules::ActionName(v.action)}};
+      if (v.line != 0) j["line"] = v.line;
+      if (!v.params.empty()) j["params"] = v.params;
+      return j;
+    };
+    if (gJson) {
+      gDoc["packets"] = {{"capture", capture}, {"count", records.size()},
+                         {"changed", nlohmann::json::array()}};
+      for (const rules::VerdictChange& v : vc) {
+        gDoc["packets"]["changed"].push_back(
+            {{"index", v.packet},
+             {"direction", v.direction == 2 ? "to-switch" : "from-switch"},
+             {"before", verdictJson(v.before)},
+             {"after", verdictJson(v.after)}});
+      }
+    }
+    for (const rules::VerdictChange& v : gJson ? std::vector<rules::VerdictChange>{} : vc) {
       std::printf("packet %zu (%s): %s -> %s\n", v.packet, v.direction == 2 ? "to switch" : "from switch",
                   v.before.Describe().c_str(), v.after.Describe().c_str());
     }
-    std::printf("%zu of %zu packets change verdict\n", vc.size(), records.size());
+    if (!gJson) std::printf("%zu of %zu packets change verdict\n", vc.size(), records.size());
     verdicts = vc.size();
   }
-  if (changes.empty() && verdicts == 0) std::printf("no differences\n");
+  if (gJson) {
+    PrintJson();
+  } else if (changes.empty() && verdicts == 0) {
+    std::printf("no differences\n");
+  }
   return changes.empty() && verdicts == 0 ? 0 : 1;
 }
 
@@ -209,9 +297,11 @@ int Diff(const std::string& a, const std::string& b, const std::string& capture,
 int main(int argc, char** argv) {
   CLI::App app{"Compiles, checks, lints and compares firewall rulesets.", "sluice-rules"};
   app.require_subcommand(1);
+  app.fallthrough();  // --json may follow the command
   app.footer(std::string("\n") + rules::kRuleSyntaxHelp);
   std::string in, out, other, capture;
   bool quiet = false;
+  app.add_flag("--json", gJson, "check, lint, diff: one JSON document on standard output");
 
   CLI::App* compile = app.add_subcommand("compile", "rule text -> wire ruleset");
   compile->add_option("TEXT", in, "rule text file")->required();
@@ -243,6 +333,7 @@ int main(int argc, char** argv) {
   diff->add_option("--vm-ip", vmIp, "IPv4 or IPv6 address of the VM side, for --direction auto");
 
   CLI11_PARSE(app, argc, argv);
+  gDoc = {{"schema", 1}, {"tool", "sluice-rules"}, {"command", app.get_subcommands()[0]->get_name()}};
   if (*compile) return Compile(in, out);
   if (*decode) return Decode(in);
   if (*check) return Check(in, quiet);

@@ -1,7 +1,8 @@
 #!/usr/bin/env bash
 # sluice-rules end to end: every example compiles, decodes to text that
 # compiles to the same bytes, and lints clean; an oversized file is refused
-# before it is read; diff with a capture names the packets that change.
+# before it is read; diff with a capture names the packets that change;
+# --json gives the same answers as documents.
 set -euo pipefail
 tool=$1
 src=$2
@@ -43,3 +44,23 @@ fails "$tool" diff "$src/examples/web.rules" "$tmp/open.rules" --capture "$src/e
 grep -q "^packet 4 (from switch): drop (general rule, line 8) -> accept (general rule, line 8)$" "$tmp/diff"
 grep -q "^1 of 9 packets change verdict$" "$tmp/diff"
 "$tool" diff "$src/examples/web.rules" "$src/examples/web.rules" | grep -q "^no differences$"
+
+# --json: the same answers as one document each, errors located.
+"$tool" check --json "$src/examples/web.rules" | python3 -c '
+import json, sys
+d = json.load(sys.stdin)
+assert d["schema"] == 1 and d["command"] == "check", d
+assert d["counts"]["rules"] == len(d["rules"]), d
+assert all(r["table"] in ("exact", "general") for r in d["rules"]), d'
+fails "$tool" check --json "$tmp/bad.rules" >"$tmp/err.json"
+python3 -c '
+import json, sys
+e = json.load(open(sys.argv[1]))["errors"][0]
+assert (e["line"], e["column"]) == (2, 8) and "gree" in e["message"], e' "$tmp/err.json"
+fails "$tool" diff --json "$src/examples/web.rules" "$tmp/open.rules" \
+  --capture "$src/examples/demo.pcapng" | python3 -c '
+import json, sys
+d = json.load(sys.stdin)
+[p] = d["packets"]["changed"]
+assert p["index"] == 4 and p["before"]["action"] == "drop" and p["after"]["action"] == "accept", p
+assert [r["change"] for r in d["rules"]] == ["changed"], d'
