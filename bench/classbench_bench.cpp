@@ -29,8 +29,11 @@
 // exclusively), with packets flowing on another thread:
 //   BM_ApplyHold/<rules>/<prepared>     10,000 ClassBench-like general
 //                                 rules replace 10,000 others (and back);
-//                                 prepared 1: the control channel's road,
-//                                 classifier built before the hold
+//                                 prepared 1: the control channels' road
+//                                 (FWReplaceRuleset: everything built
+//                                 before the hold, the hold a swap);
+//                                 prepared 0: the whole application under
+//                                 the hold
 //   BM_ExactApplyHold/<rules>     exact rules replace as many others
 // Counters: stall_ms, the longest call of the packet thread while rules
 // were replaced (its list's own time included, a few microseconds);

@@ -1,6 +1,6 @@
 // Building the compiled classifier of the general rules (layout and
-// meaning in fw_classifier.h). Runs with configLock held exclusively, or
-// by the filter's sole owner. Every temporary comes from the module heap
+// meaning in fw_classifier.h). Reads only the entries it is given: called
+// with configLock held exclusively, or on rules no packet sees yet. Every temporary comes from the module heap
 // and is released before returning, on every path.
 
 #include "firewall/fw_classifier.h"
@@ -404,32 +404,6 @@ ZelStatus FWClassifierBuild(FWRuleEntry* const* entries, uint32_t count,
   if (boxes == nullptr) return ZEL_NO_MEMORY;
   for (uint32_t i = 0; i < count; i++) Project(entries[i]->rule, &boxes[i]);
   const ZelStatus status = BuildFromBoxes(boxes, count, classifier);
-  SLCGenericFree(boxes);
-  return status;
-}
-
-ZelStatus FWClassifierPrepare(FWRuleset* ruleset, FWClassifier** classifier) {
-  *classifier = nullptr;
-  const uint32_t version = ruleset->version;
-  if (version != FW_RULESET_VERSION_7 && version != FW_RULESET_VERSION_8) return ZEL_OK;
-  const uint32_t records = ruleset->numRules;
-  if (records < g_fwClassifierTuning.minRules) return ZEL_OK;
-  Box* boxes = AllocBoxes(records);
-  if (boxes == nullptr) return ZEL_NO_MEMORY;
-  // The general records, in ruleset order, as the application installs
-  // them: the slots of a replacing application's index.
-  uint32_t count = 0;
-  for (uint32_t i = 0; i < records; i++) {
-    uint64_t size = 0;
-    const uint8_t* record = FWGetRuleFromRuleset(version, ruleset, i, &size);
-    FWRule work;
-    zel_Memset(&work, 0, sizeof(work));
-    zel_Memcpy(&work, record, size);
-    FWUpdateWildcardsToCurrent(version, &work);
-    if (work.ruleFlags & FW_GENERAL_RULE_MASK) Project(work, &boxes[count++]);
-  }
-  ZelStatus status = ZEL_OK;
-  if (count >= g_fwClassifierTuning.minRules) status = BuildFromBoxes(boxes, count, classifier);
   SLCGenericFree(boxes);
   return status;
 }

@@ -89,22 +89,6 @@ struct FWRuleEntry;
                                           FWClassifier** classifier);
 void FWClassifierFree(FWClassifier** classifier);
 
-// Builds, from a ruleset about to replace a filter's rules, the classifier
-// its application would build: the general records, in order, widened as
-// installed. Needs no lock (it reads only the ruleset, whose length the
-// caller has checked), so the build happens before the exclusive hold.
-// Null and ZEL_OK when none would be built; ZEL_NO_MEMORY when an
-// allocation fails (nothing is then allocated).
-[[nodiscard]] ZelStatus FWClassifierPrepare(FWRuleset* ruleset, FWClassifier** classifier);
-
-// FWApplyRuleset with the classifier FWClassifierPrepare made of the same
-// ruleset (or null), configLock held exclusively. Takes `prepared` over
-// whatever happens: a replacing application installs it in place of
-// building one, anything else frees it.
-[[nodiscard]] ZelStatus FWApplyPreparedRuleset(SLCGenericFilter* filter, FWRuleset* ruleset,
-                                               uint32_t replace, uint32_t fromIoctl,
-                                               FWClassifier* prepared);
-
 // The packet's value on every dimension.
 struct FWClsKey {
   uint32_t v[FW_CLS_DIMS];

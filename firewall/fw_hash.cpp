@@ -99,9 +99,8 @@ FWRuleEntry* FWHashFindEntry(const Hash_Table* table, const FWRuleTuple* tuple, 
   return nullptr;
 }
 
-ZelStatus FWInsertRuleInHashTable(SLCGenericFilter* filter, const FWRule* rule,
-                                  FWRuleEntry** entryOut) {
-  FWFilterContext* ctx = FWContext(filter);
+ZelStatus FWInsertRuleInHashTable(SLCGenericFilter* filter, FWFilterContext* ctx,
+                                  const FWRule* rule, FWRuleEntry** entryOut) {
   FWRuleTuple tuple;
   const uint64_t hash = FWCreateTupleFromRule(rule, &tuple);
 

@@ -80,12 +80,9 @@ inline uint64_t FWFold32(uint64_t rawHi, uint64_t rawLo) {
 }
 
 // Builds the index of `ruleList` (entries linked at the front, so walked
-// from the back), with its classifier: `*prepared` when it was built for
-// exactly these rules (taken over, *prepared set to null), else a new one.
-// An empty list yields null and ZEL_OK. ZEL_NO_MEMORY when an allocation
-// fails; nothing is then allocated (and *prepared is left as it was).
-[[nodiscard]] ZelStatus FWScanIndexBuild(const ListLinks* ruleList, FWScanIndex** index,
-                                         FWClassifier** prepared);
+// from the back), with its classifier. An empty list yields null and
+// ZEL_OK. ZEL_NO_MEMORY when an allocation fails; nothing is then allocated.
+[[nodiscard]] ZelStatus FWScanIndexBuild(const ListLinks* ruleList, FWScanIndex** index);
 void FWScanIndexFree(FWScanIndex** index);
 // Drops the slot of `entry`, if any, keeping the others in order; allocates
 // nothing. Called before the entry is unlinked and freed. With a

@@ -17,6 +17,7 @@
 #include <vector>
 #include <string>
 
+#include "control/control.h"
 #include "firewall/fw_classifier.h"
 #include "firewall/fw_index.h"
 #include "firewall/fw_ioctl.h"
@@ -256,7 +257,7 @@ TEST_F(ClassifierTest, SameRuleAsTheOrderedScanForEveryPacket) {
       for (uint32_t i = 0; i < n; i++) b.Add(gen.Rule(version, id++));
       const auto rs = b.Bytes();
       if (a == 0 && gen.P(50)) {
-        // The control channel's road: the classifier built before the
+        // The control channels' road: everything built before the
         // exclusive hold.
         std::vector<uint8_t> copy(rs);
         ASSERT_EQ(FWSetIoctlRuleset(filter_, reinterpret_cast<FWRuleset*>(copy.data()), 1),
@@ -351,40 +352,67 @@ TEST_F(ClassifierTest, AllocationFailureAnywhereInTheBuildChangesNothing) {
   }
 }
 
-// The control channel's road prepares the classifier before the hold: an
-// allocation failed there only moves the build under the hold; failed
-// anywhere else, the filter stays as it was. Either way nothing leaks.
-TEST_F(ClassifierTest, PreparedBeforeTheHoldUnderAllocationFailure) {
+// Every channel that replaces a ruleset builds the new rules (entries,
+// table, index, classifier) before the exclusive hold. An allocation failed
+// anywhere in that build leaves the filter as it was; with every allocation
+// granted, the filter holds exactly the new rules, and the former ones are
+// released after the hold (nothing leaks).
+TEST_F(ClassifierTest, ReplacementBuiltBeforeTheHoldUnderAllocationFailure) {
   g_fwClassifierTuning = {1, 2, 24, 64};
   Gen gen(0xbefe);
   rules::RulesetBuilder first(8), next(8);
   for (uint64_t i = 0; i < 80; i++) first.Add(gen.Rule(8, i + 1));
   for (uint64_t i = 0; i < 80; i++) next.Add(gen.Rule(8, 1000 + i));
-  ASSERT_EQ(Apply(first.Bytes(), true), ZEL_OK);
   FwModel model;
   model.Apply(next.Bytes(), true);
-  uint64_t succeeded = 0;
-  for (uint64_t n = 1;; n++) {
-    const Fingerprint before = Capture();
-    std::vector<uint8_t> copy = next.Bytes();
-    host::Faults::Fail("zel_HeapAllocWithRA", ZEL_NO_MEMORY, n);
-    const ZelStatus status =
-        FWSetIoctlRuleset(filter_, reinterpret_cast<FWRuleset*>(copy.data()), 1);
-    const bool injected = host::Faults::Injected("zel_HeapAllocWithRA") > 0;
-    host::Faults::ClearAll();
-    if (status == ZEL_OK) {
-      succeeded++;
-      ASSERT_NE(ctx_->scanIndex->classifier, nullptr);
-      ExpectSameAsModel(gen, model, static_cast<uint32_t>(n), 300);
-      if (!injected) break;
-      ASSERT_EQ(Apply(first.Bytes(), true), ZEL_OK);
-      EXPECT_EQ(Capture().heapBlocks, before.heapBlocks) << "allocation " << n;
-    } else {
-      ASSERT_TRUE(Capture() == before) << "allocation " << n << " changed the filter";
+  struct Channel {
+    const char* name;
+    bool fromIoctl;
+    ZelStatus (*replace)(SLCGenericFilter*, std::vector<uint8_t>&);
+  };
+  // Last the ioctl road, after which the other two are ignored for good.
+  const Channel channels[] = {
+      {"property", false,
+       [](SLCGenericFilter* f, std::vector<uint8_t>& rs) {
+         return SLCGenericRulesetPropWrite(f, nullptr, rs.data(),
+                                           static_cast<uint32_t>(rs.size()));
+       }},
+      {"restore", false,
+       [](SLCGenericFilter* f, std::vector<uint8_t>& rs) {
+         return FWRestoreState(f, rs.data(), rs.size());
+       }},
+      {"ioctl", true,
+       [](SLCGenericFilter* f, std::vector<uint8_t>& rs) {
+         return FWSetIoctlRuleset(f, reinterpret_cast<FWRuleset*>(rs.data()), 1);
+       }},
+  };
+  for (const Channel& ch : channels) {
+    ASSERT_EQ(Apply(first.Bytes(), true, ch.fromIoctl), ZEL_OK) << ch.name;
+    const uint64_t heapBlocks = Capture().heapBlocks;
+    uint64_t failures = 0;
+    for (uint64_t n = 1;; n++) {
+      const Fingerprint before = Capture();
+      std::vector<uint8_t> copy = next.Bytes();
+      host::Faults::Fail("zel_HeapAllocWithRA", ZEL_NO_MEMORY, n);
+      const ZelStatus status = ch.replace(filter_, copy);
+      const bool injected = host::Faults::Injected("zel_HeapAllocWithRA") > 0;
+      host::Faults::ClearAll();
+      if (!injected) {
+        ASSERT_EQ(status, ZEL_OK) << ch.name;
+        break;
+      }
+      failures++;
+      ASSERT_EQ(status, ZEL_FAILURE) << ch.name << " allocation " << n;
+      ASSERT_TRUE(Capture() == before) << ch.name << " allocation " << n << " changed the filter";
     }
+    // Every record, the table, the index and the classifier's blocks.
+    EXPECT_GT(failures, 80u + 3u) << ch.name;
+    ASSERT_NE(ctx_->scanIndex->classifier, nullptr);
+    ExpectSameAsModel(gen, model, 0, 300);
+    ASSERT_EQ(Apply(first.Bytes(), true, ch.fromIoctl), ZEL_OK);
+    EXPECT_EQ(Capture().heapBlocks, heapBlocks) << ch.name;
+    Clear();
   }
-  // Failures inside the preparation were absorbed by the build under the hold.
-  EXPECT_GT(succeeded, 1u);
 }
 
 }  // namespace
