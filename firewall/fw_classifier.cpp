@@ -199,15 +199,6 @@ struct Builder {
     *copies = total;
   }
 
-  // Every rule of the list covers [lo, hi] of dimension d.
-  bool AllCover(uint32_t off, uint32_t count, uint32_t d, uint64_t lo, uint64_t hi) const {
-    for (uint32_t k = 0; k < count; k++) {
-      const Box& b = boxes[scratch.data[off + k]];
-      if (b.lo[d] > lo || b.hi[d] < hi) return false;
-    }
-    return true;
-  }
-
   // Builds node `node` for the rules scratch[off, off + count) in region
   // `reg`, spending at most `budget` leaf entries (nodes at kNodeCost) on
   // the subtree; at least `count`, what a leaf takes. A cut keeps enough
@@ -221,7 +212,9 @@ struct Builder {
       return MakeLeaf(node, off, count);
     }
     // The cut that leaves the smallest largest child within the space
-    // factor; fewer copies break ties.
+    // factor; fewer copies break ties. Only a cut whose every child holds
+    // fewer rules than this node is taken (sibling subtrees are shared on
+    // that ground, below).
     uint32_t bestDim = FW_CLS_DIMS, bestBits = 0, bestLargest = count;
     uint64_t bestCopies = 0;
     for (uint32_t d = 0; d < FW_CLS_DIMS; d++) {
@@ -273,12 +266,15 @@ struct Builder {
         }
       }
       const uint32_t curCount = scratch.size - curOff;
-      // Siblings with the same rules, all spanning both siblings on d,
-      // are cut the same way below: one subtree serves both.
+      // Siblings with the same rules get one subtree. It serves both
+      // because it never cuts d again: every rule of the list meets both
+      // siblings, so contains the last value of the previous one, and a
+      // cut of d anywhere below would leave one child with all the rules,
+      // which a cut must improve on. Cuts of other dimensions see the
+      // same projections in both siblings.
       if (havePrev && prevCount == curCount &&
           (curCount == 0 ||
-           (zel_Memcmp(scratch.data + prevOff, scratch.data + curOff, curCount * 4) == 0 &&
-            AllCover(curOff, curCount, d, subLo - (uint64_t{1} << shift), subHi)))) {
+           zel_Memcmp(scratch.data + prevOff, scratch.data + curOff, curCount * 4) == 0)) {
         nodes.data[childBase + c] = nodes.data[childBase + c - 1];
         scratch.size = curOff;
         continue;

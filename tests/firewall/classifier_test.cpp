@@ -11,7 +11,9 @@
 
 #include <arpa/inet.h>
 
+#include <algorithm>
 #include <cstring>
+#include <optional>
 #include <random>
 #include <tuple>
 #include <vector>
@@ -297,6 +299,63 @@ TEST_F(ClassifierTest, SameRuleAsTheOrderedScanForEveryPacket) {
   EXPECT_GT(residual, 0u);
   EXPECT_GT(hits_, checked_ / 3);
   RecordProperty("hits", std::to_string(hits_) + "/" + std::to_string(checked_));
+}
+
+// Every value of one dimension, against rulesets of overlapping port
+// ranges crowded together so that the tree cuts deep and sibling regions
+// often hold the same rules (and share a subtree): every cut boundary and
+// every range end is met, which packets drawn at random seldom do.
+TEST_F(ClassifierTest, EveryDestinationPortAgainstTheOrderedScan) {
+  g_fwClassifierTuning = {1, 1, 24, 256};
+  uint64_t differing = 0;
+  for (uint32_t seed = 0; seed < 12; seed++) {
+    Gen gen(0x9047u + seed);
+    rules::RulesetBuilder b(8);
+    const uint32_t n = 20 + gen.U(40);
+    const uint32_t window = gen.U(65536 - 2048);
+    for (uint32_t i = 0; i < n; i++) {
+      FWRule r;
+      std::memset(&r, 0, sizeof(r));
+      r.action = 1;
+      r.direction = SLCGenericDirectionBidirectional;
+      r.pktCount = i + 1;
+      r.ruleFlags = (FW_WC_FIELDS & ~FW_WC_DPORT) | FW_WC_RPTAG | FW_FLAG_IPV4 | FW_RANGE_DPORT;
+      // Crowded into a window, so that the tree cuts deep on this one
+      // dimension and sibling regions often hold the same rules.
+      static const uint32_t kSpan[] = {1, 8, 64, 300};
+      const uint32_t lo = window + gen.U(1024);
+      const uint32_t hi = std::min<uint32_t>(65535, lo + gen.U(kSpan[gen.U(4)]));
+      FWPutNet16(r.dPort, static_cast<uint16_t>(lo));
+      FWPutNet16(r.dPortHigh, static_cast<uint16_t>(hi));
+      b.Add(r);
+    }
+    const auto rs = b.Bytes();
+    ASSERT_EQ(Apply(rs, true), ZEL_OK);
+    ASSERT_NE(ctx_->scanIndex->classifier, nullptr);
+    FwModel model;
+    model.Apply(rs, true);
+    ModelPacket p;
+    p.presence |= FW_PKT_L2 | FW_PKT_L3 | FW_PKT_IPV4 | FW_PKT_PORTS | FW_PKT_TCP;
+    FWPutNet16(p.ethType, 0x0800);
+    p.ipProto = 6;
+    std::optional<FWRule> previous;
+    for (uint32_t port = 0; port < 65536; port++) {
+      FWPutNet16(p.dPort, static_cast<uint16_t>(port));
+      const FWRuleEntry* got = Lookup(p, 1);
+      const auto want = model.Match(p.Summary(), 1, 0);
+      ASSERT_EQ(static_cast<bool>(got), want.has_value()) << "seed " << seed << " port " << port;
+      if (got) {
+        ASSERT_TRUE(testsupport::SameRecord(got->rule, *want))
+            << "seed " << seed << " port " << port << "\n  module: "
+            << rules::FormatRule(got->rule) << "\n  model:  " << rules::FormatRule(*want);
+      }
+      differing += want.has_value() != previous.has_value() ||
+                   (want && !testsupport::SameRecord(*want, *previous));
+      previous = want;
+    }
+  }
+  // The sweep crossed many rule boundaries.
+  EXPECT_GT(differing, 200u);
 }
 
 // Default limits on a larger ruleset, so the shipped configuration is
