@@ -76,8 +76,6 @@ struct FWRulesetCopyState {
 };
 
 uint64_t FWCreateTupleFromRule(const FWRule* rule, FWRuleTuple* tuple);
-// 0 when the entry's rule equals the tuple, 1 otherwise.
-int FWRuleCompare(const FWRuleEntry* entry, const FWRuleTuple* tuple);
 // Inserts into ctx->ruleHash (counted in ctx->numRules), or merges a repeat
 // into the entry already there; `filter` only names the log lines. `ctx`
 // may be a staging context that no packet sees yet.
