@@ -148,6 +148,7 @@ uint32_t TreeOf(const Box& b) {
 
 struct Builder {
   const Box* boxes;
+  uint32_t leafSize;
   HeapArray<FWClsNode> nodes;
   HeapArray<uint32_t> leaves;
   HeapArray<uint32_t> scratch;  // rule lists of the nodes being built, as a stack
@@ -208,7 +209,7 @@ struct Builder {
   [[nodiscard]] bool Build(uint32_t node, uint32_t off, uint32_t count, const Region& reg,
                            uint32_t depth, uint64_t budget) {
     const FWClassifierTuning& t = g_fwClassifierTuning;
-    if (count <= t.leafSize || depth >= t.maxDepth) {
+    if (count <= leafSize || depth >= t.maxDepth) {
       return MakeLeaf(node, off, count);
     }
     // The cut that leaves the smallest largest child within the space
@@ -314,6 +315,8 @@ ZelStatus BuildFromBoxes(Box* boxes, uint32_t count, FWClassifier** classifier) 
   {
     Builder b;
     b.boxes = boxes;
+    const FWClassifierTuning& t = g_fwClassifierTuning;
+    b.leafSize = count <= t.smallRules && t.smallLeafSize != 0 ? t.smallLeafSize : t.leafSize;
     HeapArray<uint32_t> residual;
     auto* tree = static_cast<uint8_t*>(SLCGenericAlloc(count));
     bool ok = tree != nullptr && b.counts.Reserve((1u << kMaxCutBits) + 1) &&

@@ -67,17 +67,22 @@ struct FWClassifier {
 };
 
 // Build limits. Rulesets smaller than minRules are scanned in order; a
-// node with at most leafSize rules is a leaf; the tree holds at most
-// budgetPerRule 4-byte words (leaf entries; a node takes three) per rule.
-// Tests lower them to exercise deep trees on small rulesets.
+// node with at most leafSize rules is a leaf (smallLeafSize, when not 0,
+// for rulesets of at most smallRules rules: finer leaves test fewer
+// candidates per packet, and only small rulesets build them fast enough);
+// the tree holds at most budgetPerRule 4-byte words (leaf entries; a node
+// takes three) per rule. Tests lower them to exercise deep trees on small
+// rulesets.
 struct FWClassifierTuning {
   uint32_t minRules;
   uint32_t leafSize;
   uint32_t maxDepth;
   uint32_t budgetPerRule;
+  uint32_t smallLeafSize;
+  uint32_t smallRules;
 };
 extern FWClassifierTuning g_fwClassifierTuning;
-inline constexpr FWClassifierTuning kFWClassifierDefaults = {24, 16, 24, 256};
+inline constexpr FWClassifierTuning kFWClassifierDefaults = {24, 16, 24, 256, 8, 16384};
 
 struct FWScanSlot;
 struct FWRuleEntry;

@@ -249,7 +249,8 @@ TEST_F(ClassifierTest, SameRuleAsTheOrderedScanForEveryPacket) {
     Gen gen(0xc1a55000u + iter);
     // Leaves of 1 to 8 rules, and now and then a budget that stops the
     // cutting early.
-    g_fwClassifierTuning = {1, 1 + gen.U(8), 1 + gen.U(24), gen.P(20) ? 1u + gen.U(4) : 64u};
+    g_fwClassifierTuning = {1, 1 + gen.U(8), 1 + gen.U(24), gen.P(20) ? 1u + gen.U(4) : 64u,
+                            gen.P(30) ? 1u + gen.U(4) : 0u, 150};
     FwModel model;
     const uint32_t applications = 1 + gen.U(3);
     for (uint32_t a = 0; a < applications; a++) {
@@ -286,7 +287,10 @@ TEST_F(ClassifierTest, SameRuleAsTheOrderedScanForEveryPacket) {
     }
     left.clear();
     for (const FWRuleEntry* e : GeneralEntries()) left.push_back(e->rule);
-    ASSERT_LT(left.size(), model.General().size()) << "iteration " << iter;
+    // A lone general rule is kept, so that the classifier has rules left.
+    if (model.General().size() > 1) {
+      ASSERT_LT(left.size(), model.General().size()) << "iteration " << iter;
+    }
     FwModel after;
     rules::RulesetBuilder b(8);
     for (const FWRule& r : left) b.Add(r);
@@ -306,7 +310,7 @@ TEST_F(ClassifierTest, SameRuleAsTheOrderedScanForEveryPacket) {
 // often hold the same rules (and share a subtree): every cut boundary and
 // every range end is met, which packets drawn at random seldom do.
 TEST_F(ClassifierTest, EveryDestinationPortAgainstTheOrderedScan) {
-  g_fwClassifierTuning = {1, 1, 24, 256};
+  g_fwClassifierTuning = {1, 1, 24, 256, 0, 0};
   uint64_t differing = 0;
   for (uint32_t seed = 0; seed < 12; seed++) {
     Gen gen(0x9047u + seed);
@@ -377,7 +381,7 @@ TEST_F(ClassifierTest, DefaultLimitsOnThousandsOfRules) {
 // application, in replace and in add mode: the filter as it was, nothing
 // leaked; the next attempt succeeds.
 TEST_F(ClassifierTest, AllocationFailureAnywhereInTheBuildChangesNothing) {
-  g_fwClassifierTuning = {1, 2, 24, 64};
+  g_fwClassifierTuning = {1, 2, 24, 64, 0, 0};
   Gen gen(0xfa11);
   rules::RulesetBuilder first(8), next(8);
   for (uint64_t i = 0; i < 150; i++) first.Add(gen.Rule(8, i + 1));
@@ -417,7 +421,7 @@ TEST_F(ClassifierTest, AllocationFailureAnywhereInTheBuildChangesNothing) {
 // granted, the filter holds exactly the new rules, and the former ones are
 // released after the hold (nothing leaks).
 TEST_F(ClassifierTest, ReplacementBuiltBeforeTheHoldUnderAllocationFailure) {
-  g_fwClassifierTuning = {1, 2, 24, 64};
+  g_fwClassifierTuning = {1, 2, 24, 64, 0, 0};
   Gen gen(0xbefe);
   rules::RulesetBuilder first(8), next(8);
   for (uint64_t i = 0; i < 80; i++) first.Add(gen.Rule(8, i + 1));
