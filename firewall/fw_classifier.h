@@ -82,7 +82,7 @@ struct FWClassifierTuning {
   uint32_t smallRules;
 };
 extern FWClassifierTuning g_fwClassifierTuning;
-inline constexpr FWClassifierTuning kFWClassifierDefaults = {24, 16, 24, 256, 8, 16384};
+inline constexpr FWClassifierTuning kFWClassifierDefaults = {24, 16, 24, 256, 8, 4096};
 
 struct FWScanSlot;
 struct FWRuleEntry;
