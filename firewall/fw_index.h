@@ -1,6 +1,7 @@
 // The scan index of the general rules: a contiguous array, in ruleset order,
 // of one 64-byte slot per entry of ruleList, built whenever ruleList changes
-// (under configLock held exclusively) and read by the general scan (shared).
+// (under configLock held exclusively, or before taking it for the staged
+// list of a replacing ruleset) and read by the general scan (shared).
 //
 // A slot is a pre-filter. The scan packs the packet's fields once into four
 // key words K[0..3]; a rule can match only when, for every word,
