@@ -29,11 +29,16 @@
 // exclusively), with packets flowing on another thread:
 //   BM_ApplyHold/<rules>/<prepared>     10,000 ClassBench-like general
 //                                 rules replace 10,000 others (and back);
-//                                 prepared 1: the control channel's road,
-//                                 classifier built before the hold
+//                                 prepared 1: the control channels' road
+//                                 (FWReplaceRuleset: everything built
+//                                 before the hold, the hold a swap);
+//                                 prepared 0: the whole application under
+//                                 the hold
 //   BM_ExactApplyHold/<rules>     exact rules replace as many others
-// Counters: stall_ms, the longest call of the packet thread while rules
-// were replaced (its list's own time included, a few microseconds);
+// Counters: hold_ms, the longest exclusive hold of configLock (the host
+// times every write hold); stall_ms, the longest call of the packet thread
+// while rules were replaced (its list's own time included, a few
+// microseconds, and any time the scheduler gave the other thread);
 // apply_ms, the whole replacement as the caller sees it.
 //
 // Exact hits, 2^18 distinct frames (flows drawn at random among the
@@ -187,7 +192,7 @@ FWRule MixedRecordOf(const Rule4& x, uint32_t i, bool* matchesNothing) {
 // while another thread sends `lists` through the packet path; the longest
 // packet call seen while replacing, and the mean replacement, in ms.
 struct HoldResult {
-  double stallMs, applyMs;
+  double stallMs, applyMs, holdMs;
 };
 
 HoldResult MeasureHold(void* priv, std::vector<std::unique_ptr<host::PacketList>>& lists,
@@ -210,6 +215,7 @@ HoldResult MeasureHold(void* priv, std::vector<std::unique_ptr<host::PacketList>
     }
   });
   double total = 0;
+  host::Locks::ResetWriteHolds("slcg.fw.config");
   for (int r = 0; r < rounds; r++) {
     std::vector<uint8_t> copy(r % 2 == 0 ? a : b);
     auto* rs = reinterpret_cast<FWRuleset*>(copy.data());
@@ -232,7 +238,8 @@ HoldResult MeasureHold(void* priv, std::vector<std::unique_ptr<host::PacketList>
   }
   stop.store(true);
   packets.join();
-  return {worst.load() / 1e6, total / rounds / 1e6};
+  return {worst.load() / 1e6, total / rounds / 1e6,
+          static_cast<double>(host::Locks::LongestWriteHoldNs("slcg.fw.config")) / 1e6};
 }
 
 class Bench {
@@ -573,6 +580,7 @@ void BM_ApplyHold(benchmark::State& state) {
   HoldResult r{};
   for (auto _ : state) r = b.Hold(state.range(1) != 0);
   state.counters["stall_ms"] = r.stallMs;
+  state.counters["hold_ms"] = r.holdMs;
   state.counters["apply_ms"] = r.applyMs;
 }
 BENCHMARK(BM_ApplyHold)->Args({10000, 0})->Args({10000, 1})->Iterations(1)->UseRealTime();
@@ -587,6 +595,7 @@ void BM_ExactApplyHold(benchmark::State& state) {
   HoldResult r{};
   for (auto _ : state) r = exactBench->Hold();
   state.counters["stall_ms"] = r.stallMs;
+  state.counters["hold_ms"] = r.holdMs;
   state.counters["apply_ms"] = r.applyMs;
 }
 BENCHMARK(BM_ExactApplyHold)->Arg(100000)->Iterations(1)->UseRealTime();

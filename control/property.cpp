@@ -4,7 +4,8 @@
 // The framework routes each operation to one filter and passes that
 // filter's record; the handlers rely on it being live (they neither compare
 // its magic nor take its lock). A write is validated without any lock and
-// applied under configLock held exclusively; read and poll hold it shared,
+// built before configLock is taken exclusively to swap it in; read and
+// poll hold it shared,
 // so a poll's size is exactly what a read at that moment produces.
 #include "control/control.h"
 #include "firewall/fw_ioctl.h"
@@ -88,11 +89,11 @@ ZelStatus SLCGenericRulesetPropWrite(void* filter, void* /*ctx*/, const void* da
     return ZEL_INVALID_STATE;
   }
   SLCG_LOG(SLCG_PROGRESS, "Got SLCGenericPropWrite of length %d", static_cast<int>(len));
-  SLCGenericWriteGuard hold(ctx->configLock);
   // The apply step only reads the ruleset; its signature is shared with
-  // callers that own their buffer.
-  return FWApplyRuleset(static_cast<SLCGenericFilter*>(filter),
-                        const_cast<FWRulesetHeader*>(ruleset), 1, 0);
+  // callers that own their buffer. It takes configLock itself, exclusively
+  // only to swap the rules it built in.
+  return FWReplaceRuleset(static_cast<SLCGenericFilter*>(filter),
+                          const_cast<FWRulesetHeader*>(ruleset), 0);
 }
 
 // The framework sizes `buf` from the last poll; no size is checked here.

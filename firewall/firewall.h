@@ -76,10 +76,11 @@ struct FWRulesetCopyState {
 };
 
 uint64_t FWCreateTupleFromRule(const FWRule* rule, FWRuleTuple* tuple);
-// 0 when the entry's rule equals the tuple, 1 otherwise.
-int FWRuleCompare(const FWRuleEntry* entry, const FWRuleTuple* tuple);
-[[nodiscard]] ZelStatus FWInsertRuleInHashTable(SLCGenericFilter* filter, const FWRule* rule,
-                                                FWRuleEntry** entry);
+// Inserts into ctx->ruleHash (counted in ctx->numRules), or merges a repeat
+// into the entry already there; `filter` only names the log lines. `ctx`
+// may be a staging context that no packet sees yet.
+[[nodiscard]] ZelStatus FWInsertRuleInHashTable(SLCGenericFilter* filter, FWFilterContext* ctx,
+                                                const FWRule* rule, FWRuleEntry** entry);
 void FWRuleEntryFree(FWRuleEntry* entry);
 void FWDestroyHash(Hash_Table** table);
 // A table for n rules (at least 256 buckets, four per rule).
@@ -93,9 +94,15 @@ bool FWIterRulesetGet(void* entry, void* ruleset);
 
 // Installs `ruleset`, replacing or adding to the rules in force, all or
 // nothing. The caller guarantees the header and all numRules records of its
-// version are readable.
+// version are readable, and holds configLock exclusively.
 [[nodiscard]] ZelStatus FWApplyRuleset(SLCGenericFilter* filter, FWRuleset* ruleset,
                                        uint32_t replace, uint32_t fromIoctl);
+// FWApplyRuleset with replace = 1 for a caller holding no lock: the new
+// rules (entries, table, index, classifier) are built before configLock is
+// taken exclusively, the hold only swaps them in, and the former rules are
+// released after it. Same outcome, status and logs as FWApplyRuleset.
+[[nodiscard]] ZelStatus FWReplaceRuleset(SLCGenericFilter* filter, FWRuleset* ruleset,
+                                         uint32_t fromIoctl);
 // Writes the rules in force; the buffer holds 15 + 281 * numRules bytes.
 void FWPopulateRuleset(FWFilterContext* ctx, FWRuleset* ruleset);
 void FWClearRules(FWFilterContext* ctx);
@@ -155,7 +162,8 @@ const uint8_t* SLCGenericFindSGEntry(ZelPkt* pkt, uint32_t start, uint32_t end);
 
 void FWFilterIoctlRequest(SLCGenericFilter* filter, uint32_t requestCode, void* payload,
                           uint64_t payloadLen);
-// Takes configLock exclusively and applies `ruleset` with fromIoctl = 1.
+// Applies `ruleset` with fromIoctl = 1; takes configLock itself (a
+// replacement through FWReplaceRuleset).
 [[nodiscard]] ZelStatus FWSetIoctlRuleset(SLCGenericFilter* filter, FWRuleset* ruleset,
                                           uint32_t replace);
 

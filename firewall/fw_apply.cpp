@@ -1,19 +1,21 @@
 // Applying a ruleset to a filter, exporting a filter's rules as a ruleset,
 // and clearing them.
 //
-// FWApplyRuleset is all or nothing. It builds a new exact-rule table sized
-// for everything the filter will hold, snapshots the context, and then
-// either completes or puts the snapshot back:
-//   - replace: the former general rules wait on a side list (on this stack
-//     frame) and the former table stays untouched until success;
-//   - add: the former table is copied into the new one (copies share the
-//     originals' sockets and tags; whichever record survives owns them) and
-//     the new general rules are linked in front of the former ones.
-// Success installs a new scan index of the general rules (fw_index.h),
-// allocated last (with the classifier prepared before the hold, when the
-// caller made one), and releases what was replaced (or only the memory of the
-// originals when adding). Undo releases what this application created and
-// restores the snapshot (the former index with it).
+// Applying is all or nothing, in two ways:
+//   - replace: the new rules are built whole in a staging context of their
+//     own (table, general list, scan index with its classifier), which
+//     needs none of the former rules and so no lock: FWReplaceRuleset
+//     builds it before taking configLock exclusively, and the hold only
+//     swaps the staged rules with those in force (no allocation, nothing
+//     can fail). The former rules are released after the hold. A failed
+//     build releases what it made; the filter was never touched;
+//   - add: under the hold, a new exact-rule table sized for everything the
+//     filter will hold takes copies of the former entries (copies share
+//     the originals' sockets and tags; whichever record survives owns them)
+//     and the new general rules are linked in front of the former ones;
+//     the context is snapshotted first and put back on failure. Success
+//     installs a new scan index (fw_index.h), allocated last, and frees
+//     only the memory of the originals.
 //
 // Resource-pool tags. Every tag obtained from the host is handed back
 // exactly once, so that undoing or re-applying rulesets never leaks one:
@@ -31,7 +33,8 @@
 //     copies at all. Undo is rare, so the extra probe per entry is cheap.
 //
 // Every function here runs with the filter's configLock held exclusively,
-// except FWPopulateRuleset (shared suffices).
+// except FWPopulateRuleset (shared suffices), FWReplaceRuleset (takes it)
+// and the staging of a replacement (no lock: it touches no filter state).
 
 #include "firewall/fw_index.h"
 
@@ -149,7 +152,7 @@ bool FWInstallRecord(SLCGenericFilter* filter, FWFilterContext* ctx, const FWRul
 
   FWRuleEntry* entry = nullptr;
   uint32_t before = ctx->numRules;
-  if (FWInsertRuleInHashTable(filter, work, &entry) != ZEL_OK) {
+  if (FWInsertRuleInHashTable(filter, ctx, work, &entry) != ZEL_OK) {
     SLCG_LOG_OBJ(SLCG_ATTENTION, filter->name, "Failed to insert hash entry");
     FWReleasePoolTag(&tag);
     return false;
@@ -160,7 +163,7 @@ bool FWInstallRecord(SLCGenericFilter* filter, FWFilterContext* ctx, const FWRul
     FWRule mirror;
     FWBuildMirror(work, &mirror);
     before = ctx->numRules;
-    if (FWInsertRuleInHashTable(filter, &mirror, &entry) != ZEL_OK) {
+    if (FWInsertRuleInHashTable(filter, ctx, &mirror, &entry) != ZEL_OK) {
       SLCG_LOG_OBJ(SLCG_ATTENTION, filter->name,
                    "Failed to insert second half of bidirectional rule");
       FWReleasePoolTag(&tag);
@@ -183,56 +186,115 @@ void FWReleaseList(ListLinks* head) {
 
 }  // namespace
 
-ZelStatus FWApplyRuleset(SLCGenericFilter* filter, FWRuleset* ruleset, uint32_t replace,
-                         uint32_t fromIoctl) {
-  return FWApplyPreparedRuleset(filter, ruleset, replace, fromIoctl, nullptr);
-}
-
 namespace {
 
-// Frees a prepared classifier that the application did not take.
-struct FWPreparedGuard {
-  FWClassifier* classifier;
-  ~FWPreparedGuard() { FWClassifierFree(&classifier); }
-};
-
-}  // namespace
-
-ZelStatus FWApplyPreparedRuleset(SLCGenericFilter* filter, FWRuleset* ruleset, uint32_t replace,
-                                 uint32_t fromIoctl, FWClassifier* prepared) {
-  FWPreparedGuard preparedGuard{replace != 0 ? prepared : nullptr};
-  if (replace == 0) FWClassifierFree(&prepared);
-  FWFilterContext* ctx = FWContext(filter);
-
-  // Once a ruleset came by an ioctl road, the property and restores are
-  // ignored for the filter's life.
-  if (ctx->ioctl && !fromIoctl) return ZEL_OK;
-  ctx->ioctl = fromIoctl ? 1 : 0;
-
+// Version check and the opening log line, common to both modes.
+ZelStatus FWCheckVersion(SLCGenericFilter* filter, const FWRuleset* ruleset, uint32_t replace) {
   const uint32_t version = ruleset->version;
   if (version != FW_RULESET_VERSION_7 && version != FW_RULESET_VERSION_8) {
     SLCG_LOG_OBJ(SLCG_PROGRESS, filter->name, "Invalid ruleset version. Got %d, expecting %d",
                  static_cast<int>(version), static_cast<int>(FW_RULESET_VERSION_8));
     return ZEL_NOT_SUPPORTED;
   }
-  const uint32_t numRecords = ruleset->numRules;
-  const bool replacing = replace != 0;
   SLCG_LOG_OBJ(SLCG_PROGRESS, filter->name,
                "Applying %u fastpath firewall rules (with replace: %d) fwFeatures = 0x%x",
-               numRecords, static_cast<int>(replace), static_cast<uint32_t>(ruleset->fwFeatures));
+               ruleset->numRules, static_cast<int>(replace),
+               static_cast<uint32_t>(ruleset->fwFeatures));
+  return ZEL_OK;
+}
+
+// A replacing ruleset built in a context of its own, which no packet sees:
+// it reads nothing of the filter's rules, so it needs no lock. Fills
+// `staged` (its ruleList head must stay where it is) and returns ZEL_OK, or
+// releases everything it made and returns ZEL_FAILURE (or
+// ZEL_NOT_SUPPORTED for a version it does not know).
+ZelStatus FWStageRuleset(SLCGenericFilter* filter, FWRuleset* ruleset, FWFilterContext* staged) {
+  *staged = FWFilterContext{};
+  List_Init(&staged->ruleList);
+  if (ZelStatus s = FWCheckVersion(filter, ruleset, 1)) return s;
+  const uint32_t version = ruleset->version;
+  const uint32_t numRecords = ruleset->numRules;
+  staged->ruleHash = FWAllocRuleHash(numRecords);
+  if (staged->ruleHash == nullptr) {
+    SLCG_LOG_OBJ(SLCG_ATTENTION, filter->name, "Failed to allocate firewall ruleset hash");
+    return ZEL_FAILURE;
+  }
+  staged->fragOverride = ruleset->fragOverride;
+  staged->version = version;
+  staged->fwFeatures = ruleset->fwFeatures;
+
+  bool ok = true;
+  uint32_t k = 0;
+  for (uint32_t i = 0; ok && i < numRecords; i++) {
+    uint64_t size = 0;
+    const uint8_t* record = FWGetRuleFromRuleset(version, ruleset, i, &size);
+    FWRule work;
+    zel_Memset(&work, 0, sizeof(work));
+    zel_Memcpy(&work, record, size);
+    FWUpdateWildcardsToCurrent(version, &work);
+    ok = FWInstallRecord(filter, staged, &work, &k);
+  }
+  if (ok && FWScanIndexBuild(&staged->ruleList, &staged->scanIndex) != ZEL_OK) {
+    SLCG_LOG_OBJ(SLCG_ATTENTION, filter->name, "Failed to allocate general rule index");
+    ok = false;
+  }
+  if (ok) return ZEL_OK;
+
+  SLCG_LOG_OBJ(SLCG_ATTENTION, filter->name, "Undoing ...");
+  Hash_Iterate(staged->ruleHash, FWIterUndoEntry, nullptr);
+  Hash_Free(staged->ruleHash);
+  staged->ruleHash = nullptr;
+  FWReleaseList(&staged->ruleList);
+  return ZEL_FAILURE;
+}
+
+// Swaps the staged rules with those in force (configLock held
+// exclusively): afterwards `staged` holds the former rules, for
+// FWClearRules once no packet can see them. Allocates nothing.
+void FWSwapStaged(FWFilterContext* ctx, FWFilterContext* staged) {
+  ListLinks former;
+  List_Init(&former);
+  List_Append(&former, &ctx->ruleList);
+  List_Append(&ctx->ruleList, &staged->ruleList);
+  List_Append(&staged->ruleList, &former);
+  Hash_Table* table = ctx->ruleHash;
+  ctx->ruleHash = staged->ruleHash;
+  staged->ruleHash = table;
+  FWScanIndex* index = ctx->scanIndex;
+  ctx->scanIndex = staged->scanIndex;
+  staged->scanIndex = index;
+  const uint32_t numRules = ctx->numRules;
+  ctx->numRules = staged->numRules;
+  staged->numRules = numRules;
+  ctx->fragOverride = staged->fragOverride;
+  ctx->version = staged->version;
+  ctx->fwFeatures = staged->fwFeatures;
+}
+
+// Once a ruleset came by an ioctl road, the property and restores are
+// ignored for the filter's life. configLock held exclusively.
+bool FWIgnored(const FWFilterContext* ctx, uint32_t fromIoctl) {
+  return ctx->ioctl != 0 && fromIoctl == 0;
+}
+
+// Adds `ruleset` to the rules in force. A new table, sized for both, takes
+// copies of the former entries; the new general rules are linked in front
+// of the former ones. configLock held exclusively.
+ZelStatus FWAddRuleset(SLCGenericFilter* filter, FWFilterContext* ctx, FWRuleset* ruleset) {
+  if (ZelStatus s = FWCheckVersion(filter, ruleset, 0)) return s;
+  const uint32_t version = ruleset->version;
+  const uint32_t numRecords = ruleset->numRules;
 
   // Sized once for everything the filter will hold (32-bit sum, as the
   // sizing itself is 32-bit); no table ever grows while rules go in.
-  Hash_Table* table = FWAllocRuleHash(numRecords + (replacing ? 0 : ctx->numRules));
+  Hash_Table* table = FWAllocRuleHash(numRecords + ctx->numRules);
   if (table == nullptr) {
     SLCG_LOG_OBJ(SLCG_ATTENTION, filter->name, "Failed to allocate firewall ruleset hash");
     return ZEL_FAILURE;
   }
 
   const FWFilterContext snapshot = *ctx;
-  ListLinks side;          // replace: the former general rules until success
-  List_Init(&side);
-  uint32_t k = 0;          // general entries created by this application
+  uint32_t k = 0;  // general entries created by this application
   bool ok = true;
 
   ctx->ruleHash = table;
@@ -240,10 +302,7 @@ ZelStatus FWApplyPreparedRuleset(SLCGenericFilter* filter, FWRuleset* ruleset, u
   ctx->version = version;
   ctx->fwFeatures = ruleset->fwFeatures;
 
-  if (replacing) {
-    List_Append(&side, &ctx->ruleList);
-    ctx->numRules = 0;
-  } else if (snapshot.ruleHash != nullptr) {
+  if (snapshot.ruleHash != nullptr) {
     FWRulesetCopyState copy{table, 0};
     (void)Hash_IterateWithCheck(snapshot.ruleHash, FWIterCopyElement, &copy);
     if (copy.failed) {
@@ -263,9 +322,9 @@ ZelStatus FWApplyPreparedRuleset(SLCGenericFilter* filter, FWRuleset* ruleset, u
   }
 
   // The scan index of the general rules as they now stand (the former ones
-  // first when adding); the former index stays in force until success.
+  // first); the former index stays in force until success.
   FWScanIndex* index = nullptr;
-  if (ok && FWScanIndexBuild(&ctx->ruleList, &index, &preparedGuard.classifier) != ZEL_OK) {
+  if (ok && FWScanIndexBuild(&ctx->ruleList, &index) != ZEL_OK) {
     SLCG_LOG_OBJ(SLCG_ATTENTION, filter->name, "Failed to allocate general rule index");
     ok = false;
   }
@@ -275,18 +334,15 @@ ZelStatus FWApplyPreparedRuleset(SLCGenericFilter* filter, FWRuleset* ruleset, u
     FWScanIndexFree(&former);
     ctx->scanIndex = index;
     if (snapshot.ruleHash != nullptr) {
-      // Adding: the copies now own sockets and tags. Replacing: the former
-      // entries go with everything they own.
-      Hash_Iterate(snapshot.ruleHash, replacing ? FWIterFreeElement : FWIterFreeCopy,
-                   snapshot.ruleHash);
+      // The copies now own sockets and tags.
+      Hash_Iterate(snapshot.ruleHash, FWIterFreeCopy, snapshot.ruleHash);
       Hash_Free(snapshot.ruleHash);
     }
-    FWReleaseList(&side);
     return ZEL_OK;
   }
 
   SLCG_LOG_OBJ(SLCG_ATTENTION, filter->name, "Undoing ...");
-  Hash_Iterate(table, FWIterUndoEntry, replacing ? nullptr : snapshot.ruleHash);
+  Hash_Iterate(table, FWIterUndoEntry, snapshot.ruleHash);
   Hash_Free(table);
   // The k newest entries at the front of ruleList are this application's.
   for (; k > 0; k--) {
@@ -295,13 +351,47 @@ ZelStatus FWApplyPreparedRuleset(SLCGenericFilter* filter, FWRuleset* ruleset, u
     FWRuleEntryFree(FWEntryFromLink(l));
   }
   *ctx = snapshot;
-  if (replacing) {
-    // The snapshot's list head still points at entries that now sit on the
-    // side list; start from an empty head and move them back in order.
-    List_Init(&ctx->ruleList);
-    List_Append(&ctx->ruleList, &side);
-  }
   return ZEL_FAILURE;
+}
+
+}  // namespace
+
+ZelStatus FWApplyRuleset(SLCGenericFilter* filter, FWRuleset* ruleset, uint32_t replace,
+                         uint32_t fromIoctl) {
+  FWFilterContext* ctx = FWContext(filter);
+  if (FWIgnored(ctx, fromIoctl)) return ZEL_OK;
+  ctx->ioctl = fromIoctl ? 1 : 0;
+  if (replace == 0) return FWAddRuleset(filter, ctx, ruleset);
+  FWFilterContext staged;
+  const ZelStatus status = FWStageRuleset(filter, ruleset, &staged);
+  if (status != ZEL_OK) return status;
+  FWSwapStaged(ctx, &staged);
+  FWClearRules(&staged);
+  return ZEL_OK;
+}
+
+ZelStatus FWReplaceRuleset(SLCGenericFilter* filter, FWRuleset* ruleset, uint32_t fromIoctl) {
+  FWFilterContext* ctx = FWContext(filter);
+  {
+    // Skip the build when the outcome is already known; checked again
+    // under the exclusive hold, as an ioctl push may come in between.
+    SLCGenericReadGuard peek(ctx->configLock);
+    if (FWIgnored(ctx, fromIoctl)) return ZEL_OK;
+  }
+  FWFilterContext staged;
+  ZelStatus status = FWStageRuleset(filter, ruleset, &staged);
+  {
+    SLCGenericWriteGuard hold(ctx->configLock);
+    if (FWIgnored(ctx, fromIoctl)) {
+      status = ZEL_OK;  // staged rules (if any) released below
+    } else {
+      ctx->ioctl = fromIoctl ? 1 : 0;
+      if (status == ZEL_OK) FWSwapStaged(ctx, &staged);
+    }
+  }
+  // The former rules (or the unused staged ones): no packet sees them.
+  FWClearRules(&staged);
+  return status;
 }
 
 void FWPopulateRuleset(FWFilterContext* ctx, FWRuleset* ruleset) {

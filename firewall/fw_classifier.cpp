@@ -1,6 +1,6 @@
 // Building the compiled classifier of the general rules (layout and
-// meaning in fw_classifier.h). Runs with configLock held exclusively, or
-// by the filter's sole owner. Every temporary comes from the module heap
+// meaning in fw_classifier.h). Reads only the entries it is given: called
+// with configLock held exclusively, or on rules no packet sees yet. Every temporary comes from the module heap
 // and is released before returning, on every path.
 
 #include "firewall/fw_classifier.h"
@@ -148,6 +148,7 @@ uint32_t TreeOf(const Box& b) {
 
 struct Builder {
   const Box* boxes;
+  uint32_t leafSize;
   HeapArray<FWClsNode> nodes;
   HeapArray<uint32_t> leaves;
   HeapArray<uint32_t> scratch;  // rule lists of the nodes being built, as a stack
@@ -199,15 +200,6 @@ struct Builder {
     *copies = total;
   }
 
-  // Every rule of the list covers [lo, hi] of dimension d.
-  bool AllCover(uint32_t off, uint32_t count, uint32_t d, uint64_t lo, uint64_t hi) const {
-    for (uint32_t k = 0; k < count; k++) {
-      const Box& b = boxes[scratch.data[off + k]];
-      if (b.lo[d] > lo || b.hi[d] < hi) return false;
-    }
-    return true;
-  }
-
   // Builds node `node` for the rules scratch[off, off + count) in region
   // `reg`, spending at most `budget` leaf entries (nodes at kNodeCost) on
   // the subtree; at least `count`, what a leaf takes. A cut keeps enough
@@ -217,11 +209,13 @@ struct Builder {
   [[nodiscard]] bool Build(uint32_t node, uint32_t off, uint32_t count, const Region& reg,
                            uint32_t depth, uint64_t budget) {
     const FWClassifierTuning& t = g_fwClassifierTuning;
-    if (count <= t.leafSize || depth >= t.maxDepth) {
+    if (count <= leafSize || depth >= t.maxDepth) {
       return MakeLeaf(node, off, count);
     }
     // The cut that leaves the smallest largest child within the space
-    // factor; fewer copies break ties.
+    // factor; fewer copies break ties. Only a cut whose every child holds
+    // fewer rules than this node is taken (sibling subtrees are shared on
+    // that ground, below).
     uint32_t bestDim = FW_CLS_DIMS, bestBits = 0, bestLargest = count;
     uint64_t bestCopies = 0;
     for (uint32_t d = 0; d < FW_CLS_DIMS; d++) {
@@ -273,12 +267,15 @@ struct Builder {
         }
       }
       const uint32_t curCount = scratch.size - curOff;
-      // Siblings with the same rules, all spanning both siblings on d,
-      // are cut the same way below: one subtree serves both.
+      // Siblings with the same rules get one subtree. It serves both
+      // because it never cuts d again: every rule of the list meets both
+      // siblings, so contains the last value of the previous one, and a
+      // cut of d anywhere below would leave one child with all the rules,
+      // which a cut must improve on. Cuts of other dimensions see the
+      // same projections in both siblings.
       if (havePrev && prevCount == curCount &&
           (curCount == 0 ||
-           (zel_Memcmp(scratch.data + prevOff, scratch.data + curOff, curCount * 4) == 0 &&
-            AllCover(curOff, curCount, d, subLo - (uint64_t{1} << shift), subHi)))) {
+           zel_Memcmp(scratch.data + prevOff, scratch.data + curOff, curCount * 4) == 0)) {
         nodes.data[childBase + c] = nodes.data[childBase + c - 1];
         scratch.size = curOff;
         continue;
@@ -318,6 +315,8 @@ ZelStatus BuildFromBoxes(Box* boxes, uint32_t count, FWClassifier** classifier) 
   {
     Builder b;
     b.boxes = boxes;
+    const FWClassifierTuning& t = g_fwClassifierTuning;
+    b.leafSize = count <= t.smallRules && t.smallLeafSize != 0 ? t.smallLeafSize : t.leafSize;
     HeapArray<uint32_t> residual;
     auto* tree = static_cast<uint8_t*>(SLCGenericAlloc(count));
     bool ok = tree != nullptr && b.counts.Reserve((1u << kMaxCutBits) + 1) &&
@@ -404,32 +403,6 @@ ZelStatus FWClassifierBuild(FWRuleEntry* const* entries, uint32_t count,
   if (boxes == nullptr) return ZEL_NO_MEMORY;
   for (uint32_t i = 0; i < count; i++) Project(entries[i]->rule, &boxes[i]);
   const ZelStatus status = BuildFromBoxes(boxes, count, classifier);
-  SLCGenericFree(boxes);
-  return status;
-}
-
-ZelStatus FWClassifierPrepare(FWRuleset* ruleset, FWClassifier** classifier) {
-  *classifier = nullptr;
-  const uint32_t version = ruleset->version;
-  if (version != FW_RULESET_VERSION_7 && version != FW_RULESET_VERSION_8) return ZEL_OK;
-  const uint32_t records = ruleset->numRules;
-  if (records < g_fwClassifierTuning.minRules) return ZEL_OK;
-  Box* boxes = AllocBoxes(records);
-  if (boxes == nullptr) return ZEL_NO_MEMORY;
-  // The general records, in ruleset order, as the application installs
-  // them: the slots of a replacing application's index.
-  uint32_t count = 0;
-  for (uint32_t i = 0; i < records; i++) {
-    uint64_t size = 0;
-    const uint8_t* record = FWGetRuleFromRuleset(version, ruleset, i, &size);
-    FWRule work;
-    zel_Memset(&work, 0, sizeof(work));
-    zel_Memcpy(&work, record, size);
-    FWUpdateWildcardsToCurrent(version, &work);
-    if (work.ruleFlags & FW_GENERAL_RULE_MASK) Project(work, &boxes[count++]);
-  }
-  ZelStatus status = ZEL_OK;
-  if (count >= g_fwClassifierTuning.minRules) status = BuildFromBoxes(boxes, count, classifier);
   SLCGenericFree(boxes);
   return status;
 }

@@ -67,17 +67,22 @@ struct FWClassifier {
 };
 
 // Build limits. Rulesets smaller than minRules are scanned in order; a
-// node with at most leafSize rules is a leaf; the tree holds at most
-// budgetPerRule 4-byte words (leaf entries; a node takes three) per rule.
-// Tests lower them to exercise deep trees on small rulesets.
+// node with at most leafSize rules is a leaf (smallLeafSize, when not 0,
+// for rulesets of at most smallRules rules: finer leaves test fewer
+// candidates per packet, and only small rulesets build them fast enough);
+// the tree holds at most budgetPerRule 4-byte words (leaf entries; a node
+// takes three) per rule. Tests lower them to exercise deep trees on small
+// rulesets.
 struct FWClassifierTuning {
   uint32_t minRules;
   uint32_t leafSize;
   uint32_t maxDepth;
   uint32_t budgetPerRule;
+  uint32_t smallLeafSize;
+  uint32_t smallRules;
 };
 extern FWClassifierTuning g_fwClassifierTuning;
-inline constexpr FWClassifierTuning kFWClassifierDefaults = {24, 16, 24, 256};
+inline constexpr FWClassifierTuning kFWClassifierDefaults = {24, 16, 24, 256, 8, 4096};
 
 struct FWScanSlot;
 struct FWRuleEntry;
@@ -88,22 +93,6 @@ struct FWRuleEntry;
 [[nodiscard]] ZelStatus FWClassifierBuild(FWRuleEntry* const* entries, uint32_t count,
                                           FWClassifier** classifier);
 void FWClassifierFree(FWClassifier** classifier);
-
-// Builds, from a ruleset about to replace a filter's rules, the classifier
-// its application would build: the general records, in order, widened as
-// installed. Needs no lock (it reads only the ruleset, whose length the
-// caller has checked), so the build happens before the exclusive hold.
-// Null and ZEL_OK when none would be built; ZEL_NO_MEMORY when an
-// allocation fails (nothing is then allocated).
-[[nodiscard]] ZelStatus FWClassifierPrepare(FWRuleset* ruleset, FWClassifier** classifier);
-
-// FWApplyRuleset with the classifier FWClassifierPrepare made of the same
-// ruleset (or null), configLock held exclusively. Takes `prepared` over
-// whatever happens: a replacing application installs it in place of
-// building one, anything else frees it.
-[[nodiscard]] ZelStatus FWApplyPreparedRuleset(SLCGenericFilter* filter, FWRuleset* ruleset,
-                                               uint32_t replace, uint32_t fromIoctl,
-                                               FWClassifier* prepared);
 
 // The packet's value on every dimension.
 struct FWClsKey {

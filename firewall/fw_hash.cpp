@@ -62,46 +62,13 @@ uint64_t FWCreateTupleFromRule(const FWRule* rule, FWRuleTuple* tuple) {
   return HashFunc_HashBytes(tuple->bytes, FWTupleHashedLen(tuple));
 }
 
-int FWRuleCompare(const FWRuleEntry* entry, const FWRuleTuple* tuple) {
-  const uint8_t* r = RuleBytes(&entry->rule) + kRuleL2;  // lines up with tuple byte 0
-  const uint8_t* t = tuple->bytes;
-  const bool ruleV4 = (entry->rule.ruleFlags & FW_FLAG_IPV4) != 0;
-  if (ruleV4 != (tuple->isIPv4 != 0)) return 1;
-  uint64_t diff;
-  if (ruleV4) {
-    // Tuple 0-21 against record 8-29: words at 0, 8 and (overlapping) 14.
-    diff = (FWLoad64(r) ^ FWLoad64(t)) | (FWLoad64(r + 8) ^ FWLoad64(t + 8)) |
-           (FWLoad64(r + 14) ^ FWLoad64(t + 14));
-    // ipDa, then protocol and ports (record 58-62 against tuple 26-30, as
-    // two overlapping 4-byte words).
-    const uint8_t* rp = RuleBytes(&entry->rule) + offsetof(FWRule, ipProto);
-    diff |= FWLoad32(entry->rule.ipDa) ^ FWLoad32(t + FW_TUPLE_V4_IPDA);
-    diff |= (FWLoad32(rp) ^ FWLoad32(t + FW_TUPLE_V4_PROTO)) |
-            (FWLoad32(rp + 1) ^ FWLoad32(t + FW_TUPLE_V4_PROTO + 1));
-  } else {
-    // Tuple 0-54 against record 8-62: words at 0..40 and (overlapping) 47.
-    diff = (FWLoad64(r) ^ FWLoad64(t)) | (FWLoad64(r + 8) ^ FWLoad64(t + 8)) |
-           (FWLoad64(r + 16) ^ FWLoad64(t + 16)) | (FWLoad64(r + 24) ^ FWLoad64(t + 24)) |
-           (FWLoad64(r + 32) ^ FWLoad64(t + 32)) | (FWLoad64(r + 40) ^ FWLoad64(t + 40)) |
-           (FWLoad64(r + 47) ^ FWLoad64(t + 47));
-  }
-  return diff != 0 ? 1 : 0;
-}
-
 FWRuleEntry* FWHashFindEntry(const Hash_Table* table, const FWRuleTuple* tuple, uint64_t hash) {
   const uint32_t h = static_cast<uint32_t>(hash);
-  ListLinks* head = &table->buckets[h & (table->numBuckets - 1)];
-  for (ListLinks* l = head->prev; l != head; l = l->prev) {
-    FWRuleEntry* entry = FWEntryFromLink(l);
-    // The stored hash rejects almost every non-equal entry with one compare.
-    if (entry->hash == h && FWRuleCompare(entry, tuple) == 0) return entry;
-  }
-  return nullptr;
+  return FWBucketFindEntry(&table->buckets[h & (table->numBuckets - 1)], tuple, h);
 }
 
-ZelStatus FWInsertRuleInHashTable(SLCGenericFilter* filter, const FWRule* rule,
-                                  FWRuleEntry** entryOut) {
-  FWFilterContext* ctx = FWContext(filter);
+ZelStatus FWInsertRuleInHashTable(SLCGenericFilter* filter, FWFilterContext* ctx,
+                                  const FWRule* rule, FWRuleEntry** entryOut) {
   FWRuleTuple tuple;
   const uint64_t hash = FWCreateTupleFromRule(rule, &tuple);
 
@@ -213,16 +180,7 @@ FWRuleEntry* FWFindExactRule(FWFilterContext* ctx, const FWRuleTuple* tuple, uin
                              uint32_t direction, ZelPkt* pkt) {
   const Hash_Table* table = ctx->ruleHash;
   if (table == nullptr) return nullptr;
-  FWRuleEntry* entry = FWHashFindEntry(table, tuple, hash);
-  if (entry == nullptr) return nullptr;
-  const FWRule& rule = entry->rule;
-  if (rule.direction != SLCGenericDirectionBidirectional && rule.direction != direction) {
-    return nullptr;
-  }
-  if (!(rule.ruleFlags & FW_WC_RPTAG)) {
-    uint16_t tag = 0;
-    (void)zel_PktResPoolTagGet(pkt, &tag);  // relied on to fill the tag
-    if (tag != rule.rpTag) return nullptr;
-  }
-  return entry;
+  const uint32_t h = static_cast<uint32_t>(hash);
+  return FWExactAccepts(FWBucketFindEntry(&table->buckets[h & (table->numBuckets - 1)], tuple, h),
+                        direction, pkt);
 }

@@ -1,6 +1,7 @@
 // Building and maintaining the scan index of the general rules (layout and
-// meaning in fw_index.h). Runs with configLock held exclusively, or by the
-// filter's sole owner while it is destroyed.
+// meaning in fw_index.h). Runs with configLock held exclusively, by the
+// filter's sole owner while it is destroyed, or on rules no packet sees
+// yet (a replacing ruleset staged before the hold).
 
 #include "firewall/fw_index.h"
 
@@ -175,8 +176,7 @@ void SlotFromRule(const FWRule& r, FWScanSlot* slot) {
 
 }  // namespace
 
-ZelStatus FWScanIndexBuild(const ListLinks* ruleList, FWScanIndex** index,
-                           FWClassifier** prepared) {
+ZelStatus FWScanIndexBuild(const ListLinks* ruleList, FWScanIndex** index) {
   *index = nullptr;
   uint64_t count = 0;
   for (const ListLinks* l = ruleList->prev; l != ruleList; l = l->prev) count++;
@@ -201,10 +201,7 @@ ZelStatus FWScanIndexBuild(const ListLinks* ruleList, FWScanIndex** index,
   }
   idx->count = i;
   idx->classifier = nullptr;
-  if (*prepared != nullptr && (*prepared)->numRules == idx->count) {
-    idx->classifier = *prepared;
-    *prepared = nullptr;
-  } else if (FWClassifierBuild(idx->entries, idx->count, &idx->classifier) != ZEL_OK) {
+  if (FWClassifierBuild(idx->entries, idx->count, &idx->classifier) != ZEL_OK) {
     SLCGenericFree(block);
     return ZEL_NO_MEMORY;
   }

@@ -1,6 +1,7 @@
 // The scan index of the general rules: a contiguous array, in ruleset order,
 // of one 64-byte slot per entry of ruleList, built whenever ruleList changes
-// (under configLock held exclusively) and read by the general scan (shared).
+// (under configLock held exclusively, or before taking it for the staged
+// list of a replacing ruleset) and read by the general scan (shared).
 //
 // A slot is a pre-filter. The scan packs the packet's fields once into four
 // key words K[0..3]; a rule can match only when, for every word,
@@ -80,12 +81,9 @@ inline uint64_t FWFold32(uint64_t rawHi, uint64_t rawLo) {
 }
 
 // Builds the index of `ruleList` (entries linked at the front, so walked
-// from the back), with its classifier: `*prepared` when it was built for
-// exactly these rules (taken over, *prepared set to null), else a new one.
-// An empty list yields null and ZEL_OK. ZEL_NO_MEMORY when an allocation
-// fails; nothing is then allocated (and *prepared is left as it was).
-[[nodiscard]] ZelStatus FWScanIndexBuild(const ListLinks* ruleList, FWScanIndex** index,
-                                         FWClassifier** prepared);
+// from the back), with its classifier. An empty list yields null and
+// ZEL_OK. ZEL_NO_MEMORY when an allocation fails; nothing is then allocated.
+[[nodiscard]] ZelStatus FWScanIndexBuild(const ListLinks* ruleList, FWScanIndex** index);
 void FWScanIndexFree(FWScanIndex** index);
 // Drops the slot of `entry`, if any, keeping the others in order; allocates
 // nothing. Called before the entry is unlinked and freed. With a

@@ -13,8 +13,10 @@
 //    than numRules records: refused with a failure status reply before any
 //    rule is read or changed (all or nothing).
 //
-// Locks: a push and a clear hold the filter's configLock exclusively, the
-// state query holds it shared while it copies; every reply is sent after the
+// Locks: a clear and an adding push hold the filter's configLock
+// exclusively; a replacing push builds its rules first and holds it
+// exclusively only to swap them in; the state query holds it shared while
+// it copies; every reply is sent after the
 // lock is released.
 #include "firewall/fw_ioctl.h"
 #include "firewall/fw_index.h"
@@ -288,15 +290,11 @@ ZelStatus FWValidateRulesetSize(uint32_t version, uint32_t numRules, uint64_t le
 }
 
 ZelStatus FWSetIoctlRuleset(SLCGenericFilter* filter, FWRuleset* ruleset, uint32_t replace) {
-  FWFilterContext* ctx = FWContext(filter);
-  // A replacing ruleset's classifier depends on nothing but the ruleset:
-  // built before the exclusive hold, the packet path keeps flowing
-  // meanwhile. Without memory for it now, the application builds it under
-  // the hold as usual (and fails cleanly if memory is still short).
-  FWClassifier* prepared = nullptr;
-  if (replace != 0 && FWClassifierPrepare(ruleset, &prepared) != ZEL_OK) prepared = nullptr;
-  SLCGenericWriteGuard hold(ctx->configLock);
-  return FWApplyPreparedRuleset(filter, ruleset, replace, 1, prepared);
+  // A replacement is built before the exclusive hold, so the packet path
+  // keeps flowing meanwhile; adding needs the rules in force throughout.
+  if (replace != 0) return FWReplaceRuleset(filter, ruleset, 1);
+  SLCGenericWriteGuard hold(FWContext(filter)->configLock);
+  return FWApplyRuleset(filter, ruleset, 0, 1);
 }
 
 void FWFilterIoctlRequest(SLCGenericFilter* filter, uint32_t requestCode, void* payload,

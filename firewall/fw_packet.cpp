@@ -17,6 +17,7 @@
 // FWWalkList).
 
 #include "firewall/fw_packet.h"
+#include "firewall/fw_rules.h"
 #include "module/locks.h"
 
 namespace {
@@ -338,7 +339,7 @@ constexpr uint32_t kPipelineMinBuckets = 16384;
 
 struct FWParsedPkt {
   ZelPkt* pkt;
-  const ListLinks* bucket;  // the tuple's bucket; null without ports
+  const ListLinks* bucket;  // the tuple's bucket in the exact table; null without ports
   uint64_t hash;            // with ports
   uint32_t frameLen;
   FWPktSummary summary;
@@ -353,7 +354,7 @@ struct FWTableView {
 };
 
 // Parses `pkt` into `slot`, with its tuple, hash and bucket when it has
-// ports; prefetches the bucket head when asked.
+// ports (null bucket otherwise); prefetches the bucket head when asked.
 template <bool kPrefetch>
 __attribute__((always_inline)) inline void FWParseInto(ZelPkt* pkt, FWParsedPkt* slot,
                                                        uint32_t fragOverride, FWTableView table) {
@@ -367,12 +368,10 @@ __attribute__((always_inline)) inline void FWParseInto(ZelPkt* pkt, FWParsedPkt*
   if (slot->summary.presence & FW_PKT_PORTS) {
     const uint64_t hash = FWTupleFromSummary(&slot->summary, &slot->tuple);
     slot->hash = hash;
-    if constexpr (kPrefetch) {
-      const ListLinks* bucket = table.buckets + (static_cast<uint32_t>(hash) & table.mask);
-      __builtin_prefetch(bucket);
-      slot->bucket = bucket;
-    }
-  } else if constexpr (kPrefetch) {
+    const ListLinks* bucket = table.buckets + (static_cast<uint32_t>(hash) & table.mask);
+    if constexpr (kPrefetch) __builtin_prefetch(bucket);
+    slot->bucket = bucket;
+  } else {
     slot->bucket = nullptr;
   }
 }
@@ -426,8 +425,11 @@ __attribute__((always_inline)) inline void FWDecide(FWWalk* walk, FWParsedPkt* c
   }
 
   FWRuleEntry* entry = nullptr;
-  if (summary->presence & FW_PKT_PORTS) {
-    entry = FWFindExactRule(ctx, &cur->tuple, cur->hash, direction, pkt);
+  if (cur->bucket != nullptr) {
+    // FWFindExactRule, with the bucket found at parse time.
+    entry = FWExactAccepts(
+        FWBucketFindEntry(cur->bucket, &cur->tuple, static_cast<uint32_t>(cur->hash)), direction,
+        pkt);
   }
   if (entry == nullptr && haveGeneralRules) {
     entry = FWFindRuleForPacket(walk->filter, pkt, direction, summary);

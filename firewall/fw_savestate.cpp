@@ -87,7 +87,6 @@ ZelStatus FWRestoreState(SLCGenericFilter* filter, const void* src, uint64_t len
   }
   // Any other version is refused by the apply step from the header alone.
 
-  SLCGenericWriteGuard config(ctx->configLock);
-  // The apply step only reads the ruleset.
-  return FWApplyRuleset(filter, const_cast<FWRuleset*>(static_cast<const FWRuleset*>(src)), 1, 0);
+  // The apply step only reads the ruleset, and takes configLock itself.
+  return FWReplaceRuleset(filter, const_cast<FWRuleset*>(static_cast<const FWRuleset*>(src)), 0);
 }

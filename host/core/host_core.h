@@ -128,6 +128,12 @@ class Locks {
   static uint64_t LiveDomains();
   // Times any lock of this name was acquired (read, write or plain).
   static uint64_t Acquisitions(std::string_view name);
+  // The longest exclusive hold of a reader/writer lock of this name (live
+  // locks only), in nanoseconds, since the last reset: how long readers
+  // were kept out. Benchmarks read it; the cost is two clock reads per
+  // write hold.
+  static uint64_t LongestWriteHoldNs(std::string_view name);
+  static void ResetWriteHolds(std::string_view name);
 };
 
 // ---------------------------------------------------------------------------

@@ -17,6 +17,7 @@
 
 #include <algorithm>
 #include <atomic>
+#include <chrono>
 #include <map>
 #include <mutex>
 #include <thread>
@@ -38,6 +39,9 @@ struct ZelLock {
   uint32_t rank = 0;
   std::atomic<uint64_t> magic{kLive};
   std::atomic<uint64_t> acquisitions{0};
+  // Write holds: when the current one began, and the longest so far.
+  std::chrono::steady_clock::time_point writeSince{};
+  std::atomic<uint64_t> longestWriteNs{0};
   ZelLockType type = ZEL_LOCK_PLAIN;
   ZelModuleID owner = -1;
   ZelLockDomainID domain = ZEL_INVALID_LOCK_DOMAIN;
@@ -296,6 +300,24 @@ uint64_t Locks::Acquisitions(std::string_view name) {
   return n;
 }
 
+uint64_t Locks::LongestWriteHoldNs(std::string_view name) {
+  LockRegistry& r = R();
+  std::lock_guard<std::mutex> g(r.mu);
+  uint64_t most = 0;
+  for (ZelLock* l : r.locks) {
+    if (l->name == name) most = std::max(most, l->longestWriteNs.load(std::memory_order_relaxed));
+  }
+  return most;
+}
+
+void Locks::ResetWriteHolds(std::string_view name) {
+  LockRegistry& r = R();
+  std::lock_guard<std::mutex> g(r.mu);
+  for (ZelLock* l : r.locks) {
+    if (l->name == name) l->longestWriteNs.store(0, std::memory_order_relaxed);
+  }
+}
+
 }  // namespace host
 
 using host::Checked;
@@ -412,10 +434,19 @@ void zel_SpinlockWriteLock(ZelLock* lock) {
   host::AcquireExclusive(l);
   l->acquisitions.fetch_add(1, std::memory_order_relaxed);
   host::Push(l, l->name.c_str(), l->rank, host::kWrite);
+  l->writeSince = std::chrono::steady_clock::now();
 }
 
 void zel_SpinlockWriteUnlock(ZelLock* lock) {
   ZelLock* l = Checked(lock, "zel_SpinlockWriteUnlock", ZEL_LOCK_RW);
   host::Pop(l, host::kWrite, "zel_SpinlockWriteUnlock");
+  // Still exclusive: writeSince is ours, and only writers raise the maximum.
+  const uint64_t held = static_cast<uint64_t>(
+      std::chrono::duration_cast<std::chrono::nanoseconds>(std::chrono::steady_clock::now() -
+                                                           l->writeSince)
+          .count());
+  if (held > l->longestWriteNs.load(std::memory_order_relaxed)) {
+    l->longestWriteNs.store(held, std::memory_order_relaxed);
+  }
   host::ReleaseExclusive(l);
 }
