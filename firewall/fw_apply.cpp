@@ -176,6 +176,23 @@ bool FWInstallRecord(SLCGenericFilter* filter, FWFilterContext* ctx, const FWRul
   return true;
 }
 
+// Installs records [0, numRecords) of `ruleset`, each widened to version 8
+// first, into `ctx`; stops at the first record that must undo the
+// application (false).
+bool FWInstallRecords(SLCGenericFilter* filter, FWFilterContext* ctx, uint32_t version,
+                      FWRuleset* ruleset, uint32_t numRecords, uint32_t* k) {
+  for (uint32_t i = 0; i < numRecords; i++) {
+    uint64_t size = 0;
+    const uint8_t* record = FWGetRuleFromRuleset(version, ruleset, i, &size);
+    FWRule work;
+    zel_Memset(&work, 0, sizeof(work));
+    zel_Memcpy(&work, record, size);
+    FWUpdateWildcardsToCurrent(version, &work);
+    if (!FWInstallRecord(filter, ctx, &work, k)) return false;
+  }
+  return true;
+}
+
 void FWReleaseList(ListLinks* head) {
   while (!List_IsEmpty(head)) {
     ListLinks* l = head->next;
@@ -223,17 +240,8 @@ ZelStatus FWStageRuleset(SLCGenericFilter* filter, FWRuleset* ruleset, FWFilterC
   staged->version = version;
   staged->fwFeatures = ruleset->fwFeatures;
 
-  bool ok = true;
   uint32_t k = 0;
-  for (uint32_t i = 0; ok && i < numRecords; i++) {
-    uint64_t size = 0;
-    const uint8_t* record = FWGetRuleFromRuleset(version, ruleset, i, &size);
-    FWRule work;
-    zel_Memset(&work, 0, sizeof(work));
-    zel_Memcpy(&work, record, size);
-    FWUpdateWildcardsToCurrent(version, &work);
-    ok = FWInstallRecord(filter, staged, &work, &k);
-  }
+  bool ok = FWInstallRecords(filter, staged, version, ruleset, numRecords, &k);
   if (ok && FWScanIndexBuild(&staged->ruleList, &staged->scanIndex) != ZEL_OK) {
     SLCG_LOG_OBJ(SLCG_ATTENTION, filter->name, "Failed to allocate general rule index");
     ok = false;
@@ -311,15 +319,7 @@ ZelStatus FWAddRuleset(SLCGenericFilter* filter, FWFilterContext* ctx, FWRuleset
     }
   }
 
-  for (uint32_t i = 0; ok && i < numRecords; i++) {
-    uint64_t size = 0;
-    const uint8_t* record = FWGetRuleFromRuleset(version, ruleset, i, &size);
-    FWRule work;
-    zel_Memset(&work, 0, sizeof(work));
-    zel_Memcpy(&work, record, size);
-    FWUpdateWildcardsToCurrent(version, &work);
-    ok = FWInstallRecord(filter, ctx, &work, &k);
-  }
+  ok = ok && FWInstallRecords(filter, ctx, version, ruleset, numRecords, &k);
 
   // The scan index of the general rules as they now stand (the former ones
   // first); the former index stays in force until success.
