@@ -60,17 +60,17 @@ echo "== loading $RULES"
 "$CTL" --socket "$SOCK" ruleset set vm1.eth0 "$RULES"
 "$CTL" --socket "$SOCK" ruleset get vm1.eth0
 
-nsx() { ip netns exec "$P-$1" "${@:2}"; }
+in_ns() { ip netns exec "$P-$1" "${@:2}"; }
 echo "== traffic"
-nsx vm ping -c 3 -i 0.2 -W 1 -q 10.77.0.2 >/dev/null && echo "ping: answered" || echo "ping: dropped"
-nsx net timeout 3 socat -u TCP-LISTEN:8080,reuseaddr - >"$DIR/web" 2>/dev/null &
-nsx net timeout 3 socat -u TCP-LISTEN:23,reuseaddr - >"$DIR/telnet" 2>/dev/null &
-nsx gre timeout 3 tcpdump --immediate-mode -i g1 -U -w "$DIR/gre.pcap" proto gre 2>/dev/null &
+in_ns vm ping -c 3 -i 0.2 -W 1 -q 10.77.0.2 >/dev/null && echo "ping: answered" || echo "ping: dropped"
+in_ns net timeout 3 socat -u TCP-LISTEN:8080,reuseaddr - >"$DIR/web" 2>/dev/null &
+in_ns net timeout 3 socat -u TCP-LISTEN:23,reuseaddr - >"$DIR/telnet" 2>/dev/null &
+in_ns gre timeout 3 tcpdump --immediate-mode -i g1 -U -w "$DIR/gre.pcap" proto gre 2>/dev/null &
 sleep 0.5
-echo "GET /" | nsx vm timeout 2 socat -u - TCP:10.77.0.2:8080,connect-timeout=1 2>/dev/null || true
-echo "login" | nsx vm timeout 2 socat -u - TCP:10.77.0.2:23,connect-timeout=1 2>/dev/null || true
-for i in 1 2 3 4 5; do echo "query $i" | nsx vm socat -u - UDP-SENDTO:10.77.0.2:53; done
-for i in 1 2 3; do echo "mirror me $i" | nsx vm socat -u - UDP-SENDTO:10.77.0.2:9999; done
+echo "GET /" | in_ns vm timeout 2 socat -u - TCP:10.77.0.2:8080,connect-timeout=1 2>/dev/null || true
+echo "login" | in_ns vm timeout 2 socat -u - TCP:10.77.0.2:23,connect-timeout=1 2>/dev/null || true
+for i in 1 2 3 4 5; do echo "query $i" | in_ns vm socat -u - UDP-SENDTO:10.77.0.2:53; done
+for i in 1 2 3; do echo "mirror me $i" | in_ns vm socat -u - UDP-SENDTO:10.77.0.2:9999; done
 wait $(jobs -p | grep -v "^$HOST_PID$") 2>/dev/null || true
 echo "tcp 8080: $( [ -s "$DIR/web" ] && echo delivered || echo not delivered)"
 echo "tcp 23:   $( [ -s "$DIR/telnet" ] && echo delivered || echo not delivered)"
