@@ -10,9 +10,26 @@
 #                 (VM side) and swside (switch side); GRE copies for
 #                 10.78.0.2 reach P-gre through P-fp's routing.
 #   topo_down P   removes them (safe to call more than once).
+#   topo_require TOOL...
+#                 for tests: exits 77 (skipped) with the reason unless
+#                 running as root with every TOOL installed.
 #
 # Senders have checksum and segmentation offload turned off so every frame
 # read from an interface is complete.
+
+topo_require() {
+  if [ "$(id -u)" -ne 0 ]; then
+    echo "SKIP: needs root to make network namespaces"
+    exit 77
+  fi
+  local tool
+  for tool in "$@"; do
+    if ! command -v "$tool" >/dev/null 2>&1; then
+      echo "SKIP: $tool is not installed (scripts/install-deps.sh installs it)"
+      exit 77
+    fi
+  done
+}
 
 topo_down() {
   local p=$1 ns

@@ -10,18 +10,8 @@ HOST_BIN=$1
 CTL_BIN=$2
 HERE=$(cd "$(dirname "$0")/../.." && pwd)
 
-if [ "$(id -u)" -ne 0 ]; then
-  echo "SKIP: needs root to make network namespaces"
-  exit 77
-fi
-for tool in ip ping socat tcpdump timeout; do
-  if ! command -v $tool >/dev/null 2>&1; then
-    echo "SKIP: $tool is not installed (scripts/install-deps.sh installs it)"
-    exit 77
-  fi
-done
-
 . "$HERE/scripts/live-topology.sh"
+topo_require ip ping socat tcpdump timeout
 P="slt$$"
 DIR=$(mktemp -d /tmp/sluice-live.XXXXXX)
 SOCK="$DIR/ctl.sock"

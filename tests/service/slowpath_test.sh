@@ -15,18 +15,8 @@ CTL_BIN=$2
 SP_BIN=$3
 HERE=$(cd "$(dirname "$0")/../.." && pwd)
 
-if [ "$(id -u)" -ne 0 ]; then
-  echo "SKIP: needs root to make network namespaces"
-  exit 77
-fi
-for tool in ip socat timeout python3 tcpdump; do
-  if ! command -v $tool >/dev/null 2>&1; then
-    echo "SKIP: $tool is not installed (scripts/install-deps.sh installs it)"
-    exit 77
-  fi
-done
-
 . "$HERE/scripts/live-topology.sh"
+topo_require ip socat timeout python3 tcpdump
 P="ssa$$"
 Q="ssb$$"
 DIR=$(mktemp -d /tmp/sluice-sp.XXXXXX)
