@@ -18,8 +18,6 @@
 namespace service {
 namespace {
 
-constexpr size_t kFrameMax = Port::kFrameMax;
-
 // Receive ring: 32 blocks of 256 KiB, a block handed over when full or
 // after 1 ms, so a lone frame waits at most that long.
 constexpr uint32_t kRingBlockSize = 1u << 18;
