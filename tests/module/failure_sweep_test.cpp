@@ -53,6 +53,10 @@ Bytes EveryAction(uint8_t version = 8) {
   b.Add("action=log ipv4 proto=tcp dport=25");
   if (version == 8) {
     b.Add("action=accept rptag=7 ipv4 proto=tcp dport=9");
+    // An exact rule comparing the tag reads it on the exact lookup.
+    b.Add("action=accept rptag=7 exact dmac=02:00:00:00:00:02 smac=02:00:00:00:00:01 vlan=none "
+          "ipv4 proto=tcp sa=10.0.0.1 da=10.0.0.2 sport=1000 dport=7");
+    b.Add("action=dot1p dot1p=2 ipv4 proto=udp dport=7777");
     b.Add("action=dscp+dot1p dscp=46 dot1p=5 ipv4 sa=10.0.0.0-10.0.0.255");
   }
   b.Add("action=drop ethtype=0x0806");
@@ -63,11 +67,11 @@ std::vector<Bytes> FramesForEveryAction() {
   using frames::FrameBuilder, frames::Ip4, frames::Ip6, frames::Mac;
   const auto a = Mac("02:00:00:00:00:01"), b = Mac("02:00:00:00:00:02");
   std::vector<Bytes> out;
-  for (uint16_t dport : {80, 443, 8080, 25, 9}) {
+  for (uint16_t dport : {80, 443, 8080, 25, 9, 7}) {
     out.push_back(FrameBuilder().Eth(b, a).Ipv4(Ip4("10.0.0.1"), Ip4("10.0.0.2")).Tcp(1000, dport)
                       .Payload(20).Build());
   }
-  for (uint16_t dport : {53, 5353, 4789}) {
+  for (uint16_t dport : {53, 5353, 4789, 7777}) {
     out.push_back(FrameBuilder().Eth(b, a).Ipv4(Ip4("10.0.0.2"), Ip4("10.0.0.3")).Udp(53, dport)
                       .Build());
   }
@@ -189,8 +193,12 @@ class Life {
         shared.writable = false;
         shared.resPoolTag = 7;
         shared.priority = 3;
+        host::PacketSpec readOnly;
+        readOnly.frame = f;
+        readOnly.writable = false;
         list.Append(host::Packets::Make(f));
         list.Append(host::Packets::Make(shared));
+        list.Append(host::Packets::Make(readOnly));
       }
       (void)host::Sluice::Deliver(a_, list, dir);
     }
@@ -209,7 +217,7 @@ class Life {
     host::Sluice::SendIoctl(a_, 4, Bytes{FWIoctlMsgGetState, 0, 0, 0});
     (void)host::Sluice::TakeIoctlReplies(a_);
     Bytes got;
-    (void)Device(FWCharDevReqGetRuleset, Bytes(15 + 12 * 281), &got);
+    (void)Device(FWCharDevReqGetRuleset, Bytes(15 + 16 * 281), &got);
     (void)Device(FWCharDevReqSendIoctl, IoctlMsg(FWIoctlMsgEcho, 0), nullptr);
     host::Sluice::SendIoctl(a_, 5, Bytes{FWIoctlMsgEcho, 0, 0, 0, 'h', 'i'});
     host::Sluice::SendIoctl(a_, 6, IoctlMsg(FWIoctlMsgClear, FWClearMethodStats));
