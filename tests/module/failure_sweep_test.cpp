@@ -14,7 +14,8 @@
 // A point first reached on an error path (a clean-up call after a failure)
 // is failed in turn together with the point that led there. The sweep ends
 // with a check that every point any run reached was failed by some run, so
-// a new host call in module code cannot go untested.
+// a new host call in module code cannot go untested, and with a check that
+// every failable host call the module library imports was reached at all.
 #include <gtest/gtest.h>
 
 #include <cstdlib>
@@ -398,6 +399,19 @@ TEST(FailureSweep, EveryReachedPointFailedLeavesNothingAndUndoes) {
   }
   std::printf("failure points: %zu reached (%zu host calls), %zu failed, %zu runs\n",
               reachedAll.size(), calls.size(), reachedAll.size() - missed, work.size() + 1);
+
+  // Every failable host call the module library imports (found in the built
+  // library at build time) must have been reached at some call site. This
+  // is per call, not per site: a second site of a call already reached
+  // elsewhere is not found here.
+  const char* const kImported[] = {
+#include "failable_imports.inc"
+  };
+  ASSERT_GT(std::size(kImported), 20u) << "the list of imported host calls looks broken";
+  for (const char* call : kImported) {
+    EXPECT_EQ(calls.count(call), 1u) << "the module calls " << call
+                                     << " but no run of the sweep reaches it";
+  }
 }
 
 }  // namespace
