@@ -20,6 +20,7 @@
 
 #include <cstdlib>
 #include <cstring>
+#include <iterator>
 #include <set>
 
 #include "control/control.h"
