@@ -14,11 +14,13 @@
 // A point first reached on an error path (a clean-up call after a failure)
 // is failed in turn together with the point that led there. The sweep ends
 // with a check that every point any run reached was failed by some run, so
-// a new host call in module code cannot go untested.
+// a new host call in module code cannot go untested, and with a check that
+// every failable host call the module library imports was reached at all.
 #include <gtest/gtest.h>
 
 #include <cstdlib>
 #include <cstring>
+#include <iterator>
 #include <set>
 
 #include "control/control.h"
@@ -53,6 +55,10 @@ Bytes EveryAction(uint8_t version = 8) {
   b.Add("action=log ipv4 proto=tcp dport=25");
   if (version == 8) {
     b.Add("action=accept rptag=7 ipv4 proto=tcp dport=9");
+    // An exact rule comparing the tag reads it on the exact lookup.
+    b.Add("action=accept rptag=7 exact dmac=02:00:00:00:00:02 smac=02:00:00:00:00:01 vlan=none "
+          "ipv4 proto=tcp sa=10.0.0.1 da=10.0.0.2 sport=1000 dport=7");
+    b.Add("action=dot1p dot1p=2 ipv4 proto=udp dport=7777");
     b.Add("action=dscp+dot1p dscp=46 dot1p=5 ipv4 sa=10.0.0.0-10.0.0.255");
   }
   b.Add("action=drop ethtype=0x0806");
@@ -63,11 +69,11 @@ std::vector<Bytes> FramesForEveryAction() {
   using frames::FrameBuilder, frames::Ip4, frames::Ip6, frames::Mac;
   const auto a = Mac("02:00:00:00:00:01"), b = Mac("02:00:00:00:00:02");
   std::vector<Bytes> out;
-  for (uint16_t dport : {80, 443, 8080, 25, 9}) {
+  for (uint16_t dport : {80, 443, 8080, 25, 9, 7}) {
     out.push_back(FrameBuilder().Eth(b, a).Ipv4(Ip4("10.0.0.1"), Ip4("10.0.0.2")).Tcp(1000, dport)
                       .Payload(20).Build());
   }
-  for (uint16_t dport : {53, 5353, 4789}) {
+  for (uint16_t dport : {53, 5353, 4789, 7777}) {
     out.push_back(FrameBuilder().Eth(b, a).Ipv4(Ip4("10.0.0.2"), Ip4("10.0.0.3")).Udp(53, dport)
                       .Build());
   }
@@ -189,8 +195,12 @@ class Life {
         shared.writable = false;
         shared.resPoolTag = 7;
         shared.priority = 3;
+        host::PacketSpec readOnly;
+        readOnly.frame = f;
+        readOnly.writable = false;
         list.Append(host::Packets::Make(f));
         list.Append(host::Packets::Make(shared));
+        list.Append(host::Packets::Make(readOnly));
       }
       (void)host::Sluice::Deliver(a_, list, dir);
     }
@@ -209,7 +219,7 @@ class Life {
     host::Sluice::SendIoctl(a_, 4, Bytes{FWIoctlMsgGetState, 0, 0, 0});
     (void)host::Sluice::TakeIoctlReplies(a_);
     Bytes got;
-    (void)Device(FWCharDevReqGetRuleset, Bytes(15 + 12 * 281), &got);
+    (void)Device(FWCharDevReqGetRuleset, Bytes(15 + 16 * 281), &got);
     (void)Device(FWCharDevReqSendIoctl, IoctlMsg(FWIoctlMsgEcho, 0), nullptr);
     host::Sluice::SendIoctl(a_, 5, Bytes{FWIoctlMsgEcho, 0, 0, 0, 'h', 'i'});
     host::Sluice::SendIoctl(a_, 6, IoctlMsg(FWIoctlMsgClear, FWClearMethodStats));
@@ -390,6 +400,19 @@ TEST(FailureSweep, EveryReachedPointFailedLeavesNothingAndUndoes) {
   }
   std::printf("failure points: %zu reached (%zu host calls), %zu failed, %zu runs\n",
               reachedAll.size(), calls.size(), reachedAll.size() - missed, work.size() + 1);
+
+  // Every failable host call the module library imports (found in the built
+  // library at build time) must have been reached at some call site. This
+  // is per call, not per site: a second site of a call already reached
+  // elsewhere is not found here.
+  const char* const kImported[] = {
+#include "failable_imports.inc"
+  };
+  ASSERT_GT(std::size(kImported), 20u) << "the list of imported host calls looks broken";
+  for (const char* call : kImported) {
+    EXPECT_EQ(calls.count(call), 1u) << "the module calls " << call
+                                     << " but no run of the sweep reaches it";
+  }
 }
 
 }  // namespace

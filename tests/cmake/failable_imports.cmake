@@ -1,0 +1,31 @@
+# Writes OUT: one C string literal per host call that the module library
+# (MODULE_LIB) imports and that the host (sources under HOST_DIR) can fail
+# on demand. Failable calls are the names a host call hands to the fault
+# check, directly or through the delivery helper.
+execute_process(COMMAND ${NM} -u ${MODULE_LIB} OUTPUT_VARIABLE imports RESULT_VARIABLE rc)
+if(NOT rc EQUAL 0)
+  message(FATAL_ERROR "${NM} -u ${MODULE_LIB} failed")
+endif()
+file(GLOB_RECURSE host_sources ${HOST_DIR}/*.cpp)
+set(failable "")
+foreach(src ${host_sources})
+  file(STRINGS ${src} lines REGEX "(Check|TakeOver)\\(")
+  foreach(line ${lines})
+    string(REGEX MATCHALL "\"(zel|QRY|Hash)_[A-Za-z0-9_]+\"" names "${line}")
+    foreach(n ${names})
+      string(REPLACE "\"" "" n ${n})
+      list(APPEND failable ${n})
+    endforeach()
+  endforeach()
+endforeach()
+list(REMOVE_DUPLICATES failable)
+list(SORT failable)
+set(text "")
+foreach(n ${failable})
+  # Imports are plain C names or mangled C++ ones (e.g. _Z10Hash_Allocj).
+  if(imports MATCHES "U ${n}\n" OR imports MATCHES "U _Z[0-9]+${n}[A-Za-z0-9_]*\n")
+    string(APPEND text "\"${n}\",\n")
+  endif()
+endforeach()
+file(WRITE ${OUT}.tmp "${text}")
+file(COPY_FILE ${OUT}.tmp ${OUT} ONLY_IF_DIFFERENT)
