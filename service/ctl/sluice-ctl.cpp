@@ -123,9 +123,9 @@ int main(int argc, char** argv) {
   std::string agentText;
   agent->add_option("text", agentText, "NAME[:default-action=ACTION_...]")->required();
   auto* addPort = app.add_subcommand("add-port", "open a port while the host runs");
-  std::string portSpec;
+  std::string portSettings;
   addPort
-      ->add_option("spec", portSpec,
+      ->add_option("settings", portSettings,
                    "name=FILTER,agent=AGENT,vm=IF,switch=IF[,uuid=U][,vnic=N][,endpoint=N]"
                    "[,failure=N]")
       ->required();
@@ -204,10 +204,10 @@ int main(int argc, char** argv) {
     req.type = Type::kCreateAgent;
     req.args["text"] = agentText;
   } else if (*addPort) {
-    // The host checks the spec; here it is only split into fields.
+    // The host checks the settings; here it is only split into fields.
     req.type = Type::kAddPort;
     nlohmann::json port = nlohmann::json::object();
-    std::stringstream in(portSpec);
+    std::stringstream in(portSettings);
     std::string item;
     while (std::getline(in, item, ',')) {
       const size_t eq = item.find('=');

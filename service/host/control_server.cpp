@@ -217,15 +217,15 @@ bool ControlServer::CreateAgent(const std::string& text, std::string* error) {
   return true;
 }
 
-bool ControlServer::AddPort(const PortSpec& spec, std::string* error) {
+bool ControlServer::AddPort(const PortSettings& settings, std::string* error) {
   std::lock_guard<std::mutex> g(mu_);
-  if (ports_.count(spec.name) != 0) {
-    *error = "port " + spec.name + " exists already";
+  if (ports_.count(settings.name) != 0) {
+    *error = "port " + settings.name + " exists already";
     return false;
   }
-  auto port = Port::Open(spec, error);
+  auto port = Port::Open(settings, error);
   if (!port) return false;
-  ports_[spec.name] = std::move(port);
+  ports_[settings.name] = std::move(port);
   return true;
 }
 
@@ -277,7 +277,7 @@ bool ControlServer::FindPort(const nlohmann::json& args, std::string* agent, hos
     *error = "no port " + name;
     return false;
   }
-  *agent = it->second->spec().agent;
+  *agent = it->second->settings().agent;
   *id = it->second->filter();
   return true;
 }
@@ -345,11 +345,11 @@ Message ControlServer::Device(const Message& req) {
     auto it = filterName.empty() ? ports_.end() : ports_.find(filterName);
     if (it == ports_.end() && !uuid.empty()) {
       for (it = ports_.begin(); it != ports_.end(); ++it) {
-        if (it->second->spec().vmUUID == uuid && it->second->spec().vnicIndex == vnic) break;
+        if (it->second->settings().vmUUID == uuid && it->second->settings().vnicIndex == vnic) break;
       }
     }
     if (it != ports_.end()) {
-      agent = it->second->spec().agent;
+      agent = it->second->settings().agent;
     } else {
       auto agents = host::Sluice::Agents();
       if (agents.size() != 1) return Fail("say which agent's device to use (agent)");
@@ -487,7 +487,7 @@ Message ControlServer::Stats() {
   {
     std::lock_guard<std::mutex> g(mu_);
     for (auto& [name, port] : ports_) {
-      nlohmann::json pj = PortSpecToJson(port->spec());
+      nlohmann::json pj = PortSettingsToJson(port->settings());
       pj["traffic"] = port->Stats();
       ports.push_back(std::move(pj));
     }
@@ -515,9 +515,9 @@ Message ControlServer::Handle(const Message& req) {
       return Reply(true);
     }
     case Type::kAddPort: {
-      PortSpec spec;
-      if (!req.args.contains("port") || !PortSpecFromJson(req.args["port"], &spec, &error) ||
-          !AddPort(spec, &error)) {
+      PortSettings settings;
+      if (!req.args.contains("port") || !PortSettingsFromJson(req.args["port"], &settings, &error) ||
+          !AddPort(settings, &error)) {
         return Fail(error.empty() ? "missing argument 'port'" : error);
       }
       return Reply(true);

@@ -34,7 +34,7 @@ class ControlServer {
   // Agents and ports, also used by the host for its command-line
   // configuration. Thread-safe.
   bool CreateAgent(const std::string& text, std::string* error);
-  bool AddPort(const PortSpec& spec, std::string* error);
+  bool AddPort(const PortSettings& settings, std::string* error);
   bool RemovePort(const std::string& name, std::string* error);
   // Closes every port; false when a filter would not go.
   bool CloseAllPorts();

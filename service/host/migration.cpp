@@ -83,9 +83,9 @@ Message ControlServer::MigrateOut(const Message& req) {
     if (it == ports_.end()) return Fail("no port " + name);
     port = it->second.get();
   }
-  PortSpec spec = port->spec();
-  if (!vmIf.empty()) spec.vmIf = vmIf;
-  if (!switchIf.empty()) spec.switchIf = switchIf;
+  PortSettings settings = port->settings();
+  if (!vmIf.empty()) settings.vmIf = vmIf;
+  if (!switchIf.empty()) settings.switchIf = switchIf;
   const host::FilterId id = port->filter();
 
   port->StopReaders();
@@ -114,7 +114,7 @@ Message ControlServer::MigrateOut(const Message& req) {
 
   Message in;
   in.type = slcproto::Type::kMigrateIn;
-  in.args["port"] = PortSpecToJson(spec);
+  in.args["port"] = PortSettingsToJson(settings);
   in.blob = state;
   Message answer;
   if (!slcproto::Call(to, in, &answer, &error, kPeerTimeoutMs)) {
@@ -141,20 +141,20 @@ Message ControlServer::MigrateOut(const Message& req) {
 
 Message ControlServer::MigrateIn(const Message& req) {
   std::string error;
-  PortSpec spec;
-  if (!req.args.contains("port") || !PortSpecFromJson(req.args["port"], &spec, &error)) {
+  PortSettings settings;
+  if (!req.args.contains("port") || !PortSettingsFromJson(req.args["port"], &settings, &error)) {
     return Fail(error.empty() ? "missing argument 'port'" : error);
   }
   {
     std::lock_guard<std::mutex> g(mu_);
-    if (ports_.count(spec.name) != 0) return Fail("port " + spec.name + " exists already");
+    if (ports_.count(settings.name) != 0) return Fail("port " + settings.name + " exists already");
   }
   // Opened without readers: no frame meets the filter before its rules do.
-  std::unique_ptr<Port> port = Port::Open(spec, &error, false);
+  std::unique_ptr<Port> port = Port::Open(settings, &error, false);
   if (!port) return Fail(error);
   const host::FilterId id = port->filter();
 
-  if (hub_.HasSlowPath(spec.agent)) {
+  if (hub_.HasSlowPath(settings.agent)) {
     const auto deadline = Clock::now() + std::chrono::milliseconds(kAttachWaitMs);
     while (host::Sluice::SlowPathOf(id) == 0 && Clock::now() < deadline) {
       std::this_thread::sleep_for(std::chrono::milliseconds(2));
@@ -180,14 +180,14 @@ Message ControlServer::MigrateIn(const Message& req) {
   port->StartReaders();
   {
     std::lock_guard<std::mutex> g(mu_);
-    if (ports_.count(spec.name) == 0) {
-      ports_[spec.name] = std::move(port);
+    if (ports_.count(settings.name) == 0) {
+      ports_[settings.name] = std::move(port);
     }
   }
   if (port) {
     // Closed outside the lock: destroying the filter talks to its slow path.
     (void)port->Close();
-    return Fail("port " + spec.name + " appeared meanwhile");
+    return Fail("port " + settings.name + " appeared meanwhile");
   }
   Message m = slcproto::Reply(true);
   m.args["slowPath"] = slowPath;

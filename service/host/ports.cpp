@@ -35,7 +35,7 @@ bool ParseU32(const std::string& v, uint32_t* out) {
   return true;
 }
 
-bool CheckPort(const PortSpec& s, std::string* error) {
+bool CheckPort(const PortSettings& s, std::string* error) {
   if (s.name.empty() || s.agent.empty() || s.vmIf.empty() || s.switchIf.empty()) {
     *error = "a port needs name, agent, vm and switch";
     return false;
@@ -110,8 +110,8 @@ bool MapRing(int fd, uint8_t** map, size_t* mapLen) {
 
 }  // namespace
 
-bool ParsePortSpec(const std::string& text, PortSpec* out, std::string* error) {
-  PortSpec s;
+bool ParsePortSettings(const std::string& text, PortSettings* out, std::string* error) {
+  PortSettings s;
   std::stringstream in(text);
   std::string item;
   while (std::getline(in, item, ',')) {
@@ -152,7 +152,7 @@ bool ParsePortSpec(const std::string& text, PortSpec* out, std::string* error) {
   return true;
 }
 
-nlohmann::json PortSpecToJson(const PortSpec& s) {
+nlohmann::json PortSettingsToJson(const PortSettings& s) {
   return {{"name", s.name},
           {"agent", s.agent},
           {"vm", s.vmIf},
@@ -163,12 +163,12 @@ nlohmann::json PortSpecToJson(const PortSpec& s) {
           {"failure", s.failurePolicy}};
 }
 
-bool PortSpecFromJson(const nlohmann::json& j, PortSpec* out, std::string* error) {
+bool PortSettingsFromJson(const nlohmann::json& j, PortSettings* out, std::string* error) {
   if (!j.is_object()) {
     *error = "port must be an object";
     return false;
   }
-  PortSpec s;
+  PortSettings s;
   auto str = [&](const char* k, std::string* v) {
     if (!j.contains(k)) return true;
     if (!j[k].is_string()) return false;
@@ -192,12 +192,12 @@ bool PortSpecFromJson(const nlohmann::json& j, PortSpec* out, std::string* error
   return true;
 }
 
-std::unique_ptr<Port> Port::Open(const PortSpec& spec, std::string* error, bool start) {
+std::unique_ptr<Port> Port::Open(const PortSettings& settings, std::string* error, bool start) {
   std::unique_ptr<Port> port(new Port);
-  port->spec_ = spec;
-  port->fd_[1] = OpenInterface(spec.switchIf, error);
+  port->settings_ = settings;
+  port->fd_[1] = OpenInterface(settings.switchIf, error);
   if (port->fd_[1] < 0) return nullptr;
-  port->fd_[2] = OpenInterface(spec.vmIf, error);
+  port->fd_[2] = OpenInterface(settings.vmIf, error);
   if (port->fd_[2] < 0) return nullptr;
   for (int side : {1, 2}) {
     Ring& r = port->ring_[side];
@@ -208,17 +208,17 @@ std::unique_ptr<Port> Port::Open(const PortSpec& spec, std::string* error, bool 
   }
 
   host::FilterConfig config;
-  config.name = spec.name;
-  config.vmUUID = spec.vmUUID;
-  config.vmUUIDUnset = spec.vmUUID.empty();
-  config.vnicIndex = spec.vnicIndex;
-  config.endPointType = spec.endPointType;
-  config.failurePolicy = spec.failurePolicy;
-  if (!host::Sluice::AgentRegistered(spec.agent)) {
-    *error = "no agent " + spec.agent;
+  config.name = settings.name;
+  config.vmUUID = settings.vmUUID;
+  config.vmUUIDUnset = settings.vmUUID.empty();
+  config.vnicIndex = settings.vnicIndex;
+  config.endPointType = settings.endPointType;
+  config.failurePolicy = settings.failurePolicy;
+  if (!host::Sluice::AgentRegistered(settings.agent)) {
+    *error = "no agent " + settings.agent;
     return nullptr;
   }
-  const ZelStatus st = host::Sluice::CreateFilter(spec.agent, config, &port->filter_);
+  const ZelStatus st = host::Sluice::CreateFilter(settings.agent, config, &port->filter_);
   if (st != ZEL_OK) {
     *error = std::string("the agent refused the filter: ") + zel_StatusToString(st);
     port->filter_ = 0;

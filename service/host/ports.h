@@ -24,7 +24,7 @@
 
 namespace service {
 
-struct PortSpec {
+struct PortSettings {
   std::string name;  // the filter's name
   std::string agent;
   std::string vmIf;      // VM-side interface
@@ -36,9 +36,9 @@ struct PortSpec {
 };
 
 // "name=N,agent=A,vm=IF,switch=IF[,uuid=U][,vnic=I][,endpoint=E][,failure=P]"
-bool ParsePortSpec(const std::string& text, PortSpec* out, std::string* error);
-nlohmann::json PortSpecToJson(const PortSpec& spec);
-bool PortSpecFromJson(const nlohmann::json& j, PortSpec* out, std::string* error);
+bool ParsePortSettings(const std::string& text, PortSettings* out, std::string* error);
+nlohmann::json PortSettingsToJson(const PortSettings& settings);
+bool PortSettingsFromJson(const nlohmann::json& j, PortSettings* out, std::string* error);
 
 struct PortCounters {
   std::atomic<uint64_t> rx[3]{};          // by direction (1, 2)
@@ -66,7 +66,7 @@ class Port {
   // Opens both interfaces, creates the filter through the framework and
   // (unless `start` is false) starts one reader per side. Null with a reason
   // on failure (nothing left behind).
-  static std::unique_ptr<Port> Open(const PortSpec& spec, std::string* error, bool start = true);
+  static std::unique_ptr<Port> Open(const PortSettings& settings, std::string* error, bool start = true);
   // Starts or stops the readers; the filter stays. A stopped port takes no
   // frames (a migrating VM is paused).
   void StartReaders();
@@ -80,7 +80,7 @@ class Port {
   bool Close(int waitMs = 5000);
   ~Port();
 
-  const PortSpec& spec() const { return spec_; }
+  const PortSettings& settings() const { return settings_; }
   host::FilterId filter() const { return filter_; }
   nlohmann::json Stats() const;
 
@@ -106,7 +106,7 @@ class Port {
   // Sends each delivery out on the side its direction leads to.
   void TransmitDeliveries(std::vector<host::Delivery> deliveries);
 
-  PortSpec spec_;
+  PortSettings settings_;
   host::FilterId filter_ = 0;
   int fd_[3] = {-1, -1, -1};  // [1] switch side, [2] VM side
   Ring ring_[3];

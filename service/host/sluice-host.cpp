@@ -31,7 +31,7 @@ struct Config {
   bool logEcho = false;
 };
 
-// "agent TEXT", "port SPEC", "socket PATH", "gre MODE"; '#' comments.
+// "agent TEXT", "port SETTINGS", "socket PATH", "gre MODE"; '#' comments.
 bool ReadConfig(const std::string& path, Config* c, std::string* error) {
   std::ifstream in(path);
   if (!in) {
@@ -105,7 +105,7 @@ int main(int argc, char** argv) {
                  "open a port: name=FILTER,agent=AGENT,vm=IF,switch=IF[,uuid=UUID][,vnic=N]"
                  "[,endpoint=N][,failure=N] (repeatable)");
   app.add_option("--config", configPath,
-                 "read settings from a file, one per line: 'agent TEXT', 'port SPEC',"
+                 "read settings from a file, one per line: 'agent TEXT', 'port SETTINGS',"
                  " 'socket PATH', 'gre kernel|memory'");
   app.add_option("--gre", c.gre,
                  "where GRE copies go: 'kernel' (raw IPPROTO_GRE socket) or 'memory' (counted,"
@@ -132,14 +132,14 @@ int main(int argc, char** argv) {
     c.agents = fromFile.agents;
     c.ports = fromFile.ports;
   }
-  std::vector<service::PortSpec> ports;
+  std::vector<service::PortSettings> ports;
   for (const auto& text : c.ports) {
-    service::PortSpec spec;
-    if (!service::ParsePortSpec(text, &spec, &error)) {
+    service::PortSettings settings;
+    if (!service::ParsePortSettings(text, &settings, &error)) {
       std::fprintf(stderr, "sluice-host: --port %s: %s\n", text.c_str(), error.c_str());
       return 2;
     }
-    ports.push_back(spec);
+    ports.push_back(settings);
   }
 
   // The host's own threads exist before main runs, so a stop signal may land
@@ -170,9 +170,9 @@ int main(int argc, char** argv) {
         rc = 1;
       }
     }
-    for (const auto& spec : ports) {
-      if (rc == 0 && !server.AddPort(spec, &error)) {
-        std::fprintf(stderr, "sluice-host: port %s: %s\n", spec.name.c_str(), error.c_str());
+    for (const auto& settings : ports) {
+      if (rc == 0 && !server.AddPort(settings, &error)) {
+        std::fprintf(stderr, "sluice-host: port %s: %s\n", settings.name.c_str(), error.c_str());
         rc = 1;
       }
     }

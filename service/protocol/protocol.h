@@ -42,7 +42,7 @@ enum class Type : uint16_t {
 
   kHello = 0x0100,          // -> {host, version, pid}
   kCreateAgent = 0x0101,    // {text}
-  kAddPort = 0x0102,        // {port: PortSpec as an object}
+  kAddPort = 0x0102,        // {port: PortSettings as an object}
   kRemovePort = 0x0103,     // {name}
   kListPorts = 0x0104,      // -> {ports: [...]} with per-port traffic counters
   kRulesetWrite = 0x0105,   // {agent, filter} + ruleset blob (ruleset property)
@@ -70,7 +70,7 @@ enum class Type : uint16_t {
   // Host-to-host migration.
   kMigrationFirst = 0x0300,
   kMigrateOut = 0x0300,     // ctl -> source: {port, to[, vm, switch]} -> {savedBytes, ...}
-  kMigrateIn = 0x0301,      // source -> destination: {port: PortSpec} + saved state
+  kMigrateIn = 0x0301,      // source -> destination: {port: PortSettings} + saved state
   kMigrationLast = 0x03ff,
 };
 
