@@ -17,6 +17,7 @@
 #include <thread>
 
 #include "service/protocol/protocol.h"
+#include "tests/service/host_process.h"
 
 namespace {
 
@@ -91,43 +92,9 @@ TEST(ServiceProtocol, RefusesBodiesThatAreNotAnObject) {
 class ServiceHostTest : public ::testing::Test {
  protected:
   void SetUp() override {
-    char tmpl[] = "/tmp/sluice-ctl-test.XXXXXX";
-    ASSERT_NE(mkdtemp(tmpl), nullptr);
-    dir_ = tmpl;
-    sock_ = dir_ + "/ctl.sock";
-    pid_ = fork();
-    ASSERT_GE(pid_, 0);
-    if (pid_ == 0) {
-      int devnull = open("/dev/null", O_WRONLY);
-      dup2(devnull, 2);
-      execl(SLUICE_HOST_BIN, "sluice-host", "--socket", sock_.c_str(), "--gre", "memory", "--agent",
-            "fw:default-action=ACTION_ACCEPT", "--max-seconds", "60", static_cast<char*>(nullptr));
-      _exit(127);
-    }
-    for (int i = 0; i < 100; i++) {
-      Message r;
-      std::string error;
-      if (Request(Type::kHello, &r)) return;
-      std::this_thread::sleep_for(std::chrono::milliseconds(50));
-    }
-    FAIL() << "sluice-host did not come up";
+    ASSERT_TRUE(host_.Start("fw:default-action=ACTION_ACCEPT")) << "sluice-host did not come up";
   }
-  void TearDown() override {
-    if (pid_ > 0) {
-      kill(pid_, SIGKILL);
-      waitpid(pid_, nullptr, 0);
-    }
-    unlink(sock_.c_str());
-    rmdir(dir_.c_str());
-  }
-  // Stops the host with SIGTERM and returns its exit status.
-  int Stop() {
-    kill(pid_, SIGTERM);
-    int status = 0;
-    waitpid(pid_, &status, 0);
-    pid_ = -1;
-    return WIFEXITED(status) ? WEXITSTATUS(status) : 128 + WTERMSIG(status);
-  }
+  int Stop() { return host_.Stop(); }
 
   bool Request(Type type, Message* reply, nlohmann::json args = nlohmann::json::object(),
                Bytes blob = {}) {
@@ -136,7 +103,7 @@ class ServiceHostTest : public ::testing::Test {
     m.args = std::move(args);
     m.blob = std::move(blob);
     std::string error;
-    return slcproto::Call(sock_, m, reply, &error, 5000);
+    return slcproto::Call(host_.sock, m, reply, &error, 5000);
   }
   uint64_t HeapBytes() {
     Message r;
@@ -146,7 +113,7 @@ class ServiceHostTest : public ::testing::Test {
   // Writes raw bytes, half-closes, and returns the reply (if one came).
   bool RawExchange(const Bytes& bytes, Message* reply) {
     std::string error;
-    int fd = slcproto::Connect(sock_, &error);
+    int fd = slcproto::Connect(host_.sock, &error);
     if (fd < 0) return false;
     (void)!write(fd, bytes.data(), bytes.size());
     shutdown(fd, SHUT_WR);
@@ -155,13 +122,12 @@ class ServiceHostTest : public ::testing::Test {
     return ok;
   }
 
-  std::string dir_, sock_;
-  pid_t pid_ = -1;
+  HostProcess host_;
 };
 
 TEST_F(ServiceHostTest, SocketIsPrivateToItsOwner) {
   struct stat st {};
-  ASSERT_EQ(stat(sock_.c_str(), &st), 0);
+  ASSERT_EQ(stat(host_.sock.c_str(), &st), 0);
   EXPECT_EQ(st.st_mode & 0777, 0600u);
 }
 
@@ -233,12 +199,12 @@ TEST_F(ServiceHostTest, MalformedRequestsGetAnErrorAndChangeNothing) {
 
 TEST_F(ServiceHostTest, ASilentClientCannotHoldOffOthers) {
   std::string error;
-  const int silent = slcproto::Connect(sock_, &error);
+  const int silent = slcproto::Connect(host_.sock, &error);
   ASSERT_GE(silent, 0) << error;
   const auto start = std::chrono::steady_clock::now();
   Message hello, reply;
   hello.type = Type::kHello;
-  ASSERT_TRUE(slcproto::Call(sock_, hello, &reply, &error, 15000)) << error;
+  ASSERT_TRUE(slcproto::Call(host_.sock, hello, &reply, &error, 15000)) << error;
   EXPECT_TRUE(reply.args.value("ok", false));
   EXPECT_LT(std::chrono::steady_clock::now() - start, std::chrono::seconds(10));
   close(silent);
@@ -263,8 +229,8 @@ TEST_F(ServiceHostTest, PeersOfAnotherUserAreRefused) {
   if (geteuid() != 0) GTEST_SKIP() << "needs root to connect as another user";
   // Opening the file to everyone leaves the credential check as the only
   // guard.
-  ASSERT_EQ(chmod(sock_.c_str(), 0666), 0);
-  ASSERT_EQ(chmod(dir_.c_str(), 0755), 0);
+  ASSERT_EQ(chmod(host_.sock.c_str(), 0666), 0);
+  ASSERT_EQ(chmod(host_.dir.c_str(), 0755), 0);
   pid_t child = fork();
   ASSERT_GE(child, 0);
   if (child == 0) {
@@ -272,7 +238,7 @@ TEST_F(ServiceHostTest, PeersOfAnotherUserAreRefused) {
     Message hello, reply;
     hello.type = Type::kHello;
     std::string error;
-    if (!slcproto::Call(sock_, hello, &reply, &error, 5000)) {
+    if (!slcproto::Call(host_.sock, hello, &reply, &error, 5000)) {
       std::fprintf(stderr, "%s\n", error.c_str());
       _exit(11);
     }

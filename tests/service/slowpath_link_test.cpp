@@ -18,6 +18,7 @@
 #include <gtest/gtest.h>
 
 #include "service/protocol/protocol.h"
+#include "tests/service/host_process.h"
 #include "service/protocol/slowpath_link.h"
 
 namespace {
@@ -67,54 +68,23 @@ TEST(SlowPathLinkFrames, RoundTripAndHostileLengths) {
 
 class SlowPathLinkTest : public ::testing::Test {
  protected:
-  void SetUp() override {
-    char tmpl[] = "/tmp/sluice-link-test.XXXXXX";
-    ASSERT_NE(mkdtemp(tmpl), nullptr);
-    dir_ = tmpl;
-    sock_ = dir_ + "/ctl.sock";
-    pid_ = fork();
-    ASSERT_GE(pid_, 0);
-    if (pid_ == 0) {
-      int devnull = open("/dev/null", O_WRONLY);
-      dup2(devnull, 2);
-      execl(SLUICE_HOST_BIN, "sluice-host", "--socket", sock_.c_str(), "--gre", "memory",
-            "--agent", "fw", "--max-seconds", "60", static_cast<char*>(nullptr));
-      _exit(127);
-    }
-    for (int i = 0; i < 100; i++) {
-      if (Call(Type::kHello).args.value("ok", false)) return;
-      std::this_thread::sleep_for(std::chrono::milliseconds(50));
-    }
-    FAIL() << "sluice-host did not come up";
-  }
+  void SetUp() override { ASSERT_TRUE(host_.Start("fw")) << "sluice-host did not come up"; }
   void TearDown() override {
     for (int fd : links_) close(fd);
-    if (pid_ > 0) {
-      kill(pid_, SIGKILL);
-      waitpid(pid_, nullptr, 0);
-    }
-    unlink(sock_.c_str());
-    rmdir(dir_.c_str());
   }
-  int Stop() {
-    kill(pid_, SIGTERM);
-    int status = 0;
-    waitpid(pid_, &status, 0);
-    pid_ = -1;
-    return WIFEXITED(status) ? WEXITSTATUS(status) : 128 + WTERMSIG(status);
-  }
+  int Stop() { return host_.Stop(); }
   Message Call(Type type, nlohmann::json args = nlohmann::json::object()) {
     Message m, reply;
     m.type = type;
     m.args = std::move(args);
     std::string error;
-    if (!slcproto::Call(sock_, m, &reply, &error, 5000)) reply.args["error"] = error;
+    if (!slcproto::Call(host_.sock, m, &reply, &error, 5000)) reply.args["error"] = error;
     return reply;
   }
   // Opens a link and sends its registration; returns the fd and the answer.
   int Register(nlohmann::json args, Message* answer) {
     std::string error;
-    int fd = slcproto::Connect(sock_, &error);
+    int fd = slcproto::Connect(host_.sock, &error);
     EXPECT_GE(fd, 0) << error;
     links_.push_back(fd);
     Message reg;
@@ -152,8 +122,7 @@ class SlowPathLinkTest : public ::testing::Test {
   }
   uint64_t Heap() { return Call(Type::kStats).args.value("heapBytes", UINT64_MAX); }
 
-  std::string dir_, sock_;
-  pid_t pid_ = -1;
+  HostProcess host_;
   std::vector<int> links_;
 };
 
