@@ -305,16 +305,18 @@ void FWApplyAction(FWWalk* walk, ZelPkt* pkt, uint32_t action, FWRuleEntry* entr
   zel_PktListIterMove(walk->iter);
 }
 
-// Two shapes of the walk share the parse and the verdict below.
+// Two shapes of the walk share the parse and the verdict below. Both take
+// their packets from a read-only iterator that runs ahead of the one that
+// carries out verdicts (FWLookahead): the packet object and the frame of
+// the packets to come are requested from memory while the current one is
+// decided, since a frame that just arrived is rarely in the caches.
 //
 // Direct: each packet is parsed and decided in turn. Used while the exact
 // table is small enough to stay in the caches, where the fewest
 // instructions win.
 //
 // Pipelined: for large tables, whose bucket and entry loads miss the caches,
-// the misses of several packets are overlapped instead of added up. A
-// second, read-only iterator runs ahead of the one that carries out
-// verdicts:
+// the misses of several packets are overlapped instead of added up:
 //   - kParseAhead packets ahead, a packet is parsed into a ring slot, its
 //     tuple hashed and its bucket head prefetched;
 //   - kEntryAhead packets ahead, the bucket's oldest entry (where the probe
@@ -326,9 +328,9 @@ void FWApplyAction(FWWalk* walk, ZelPkt* pkt, uint32_t action, FWRuleEntry* entr
 // main iterator reaches each slot's packet in order. Parsing a packet early
 // changes nothing: packets ahead are not touched by the current verdict.
 // The ring takes kRingSize * 144 bytes (2.3 KiB) of the walk's stack.
-constexpr uint32_t kRingSize = 16;  // power of two, > kParseAhead
-constexpr uint32_t kParseAhead = 8;
-constexpr uint32_t kEntryAhead = 4;
+constexpr uint32_t kRingSize = 32;  // power of two, > kParseAhead
+constexpr uint32_t kParseAhead = 24;
+constexpr uint32_t kEntryAhead = 12;
 static_assert((kRingSize & (kRingSize - 1)) == 0 && kParseAhead < kRingSize &&
               kEntryAhead < kParseAhead);
 // Tables with at least this many buckets (a few thousand exact rules) take
@@ -336,6 +338,47 @@ static_assert((kRingSize & (kRingSize - 1)) == 0 && kParseAhead < kRingSize &&
 // longer sit in the per-core caches, and a walk that waits for each miss in
 // turn costs several times one that has them in flight.
 constexpr uint32_t kPipelineMinBuckets = 16384;
+
+// The packets of a list in order, each handed out after its object and
+// the head of its frame were requested from memory. A list is linked
+// through its packet objects, so an object can only be requested once the
+// one before it is read: the iterator stands on the packet whose object
+// was requested one step earlier; a step reads that object, requests its
+// frame and the next object, and queues the packet, which is handed out
+// kLookahead steps later.
+constexpr uint32_t kLookahead = 2;
+
+struct FWLookahead {
+  ZelPktListIter* iter;
+  ZelPkt* queue[kLookahead];  // oldest first; null past the end
+};
+
+__attribute__((always_inline)) inline void FWLookaheadStep(FWLookahead* la) {
+  for (uint32_t i = 0; i + 1 < kLookahead; i++) la->queue[i] = la->queue[i + 1];
+  ZelPktListIter* iter = la->iter;
+  if (zel_PktListIterIsAtEnd(iter)) {
+    la->queue[kLookahead - 1] = nullptr;
+    return;
+  }
+  ZelPkt* pkt = zel_PktListIterGetPkt(iter);
+  __builtin_prefetch(zel_PktFrameMappedPointerGet(pkt));
+  zel_PktListIterMove(iter);
+  if (!zel_PktListIterIsAtEnd(iter)) __builtin_prefetch(zel_PktListIterGetPkt(iter));
+  la->queue[kLookahead - 1] = pkt;
+}
+
+inline void FWLookaheadStart(FWLookahead* la, ZelPktList* list, ZelPktListIter* iter) {
+  zel_PktListIterStart(list, iter);
+  la->iter = iter;
+  for (uint32_t i = 0; i < kLookahead; i++) FWLookaheadStep(la);
+}
+
+// The next packet, or null at the end of the list.
+__attribute__((always_inline)) inline ZelPkt* FWLookaheadTake(FWLookahead* la) {
+  ZelPkt* pkt = la->queue[0];
+  if (pkt != nullptr) FWLookaheadStep(la);
+  return pkt;
+}
 
 struct FWParsedPkt {
   ZelPkt* pkt;
@@ -448,20 +491,21 @@ __attribute__((always_inline)) inline void FWDecide(FWWalk* walk, FWParsedPkt* c
 }
 
 // The walk proper; configLock held shared, ruleHash not null. `ahead` is
-// storage for the pipelined walk's second iterator.
+// storage for the iterator that runs ahead.
 void FWWalkList(FWWalk* walk, ZelPktList* list, ZelPktListIter* ahead) {
   FWFilterContext* ctx = walk->ctx;
   const FWTableView table = {ctx->ruleHash->buckets, ctx->ruleHash->numBuckets - 1};
   const uint32_t fragOverride = ctx->fragOverride;
   const bool haveGeneralRules = !List_IsEmpty(&ctx->ruleList);
   const bool early = ctx->fwFeatures != 0 || fragOverride != 0;
-  ZelPktListIter* iter = walk->iter;
-  zel_PktListIterStart(list, iter);
+  zel_PktListIterStart(list, walk->iter);
+  FWLookahead la;
+  FWLookaheadStart(&la, list, ahead);
 
   if (ctx->ruleHash->numBuckets < kPipelineMinBuckets) {
     FWParsedPkt cur;
-    while (!zel_PktListIterIsAtEnd(iter)) {
-      FWParseInto<false>(zel_PktListIterGetPkt(iter), &cur, fragOverride, table);
+    while (ZelPkt* pkt = FWLookaheadTake(&la)) {
+      FWParseInto<false>(pkt, &cur, fragOverride, table);
       FWDecide(walk, &cur, early, haveGeneralRules);
     }
     return;
@@ -470,17 +514,17 @@ void FWWalkList(FWWalk* walk, ZelPktList* list, ZelPktListIter* ahead) {
   FWParsedPkt ring[kRingSize];
   uint32_t parsed = 0;  // packets parsed so far
   uint32_t done = 0;    // packets given their verdict
-  zel_PktListIterStart(list, ahead);
-  while (parsed < kParseAhead && !zel_PktListIterIsAtEnd(ahead)) {
-    FWParseInto<true>(zel_PktListIterGetPkt(ahead), &ring[parsed++ & (kRingSize - 1)],
-                      fragOverride, table);
-    zel_PktListIterMove(ahead);
+  while (parsed < kParseAhead) {
+    ZelPkt* pkt = FWLookaheadTake(&la);
+    if (pkt == nullptr) break;
+    FWParseInto<true>(pkt, &ring[parsed++ & (kRingSize - 1)], fragOverride, table);
   }
+  // The first packets' entries: their buckets were requested together, so
+  // one wait covers them all.
+  for (uint32_t i = 0; i < kEntryAhead && i < parsed; i++) FWPrefetchEntry(&ring[i]);
   while (done != parsed) {
-    if (!zel_PktListIterIsAtEnd(ahead)) {
-      FWParseInto<true>(zel_PktListIterGetPkt(ahead), &ring[parsed++ & (kRingSize - 1)],
-                        fragOverride, table);
-      zel_PktListIterMove(ahead);
+    if (ZelPkt* pkt = FWLookaheadTake(&la)) {
+      FWParseInto<true>(pkt, &ring[parsed++ & (kRingSize - 1)], fragOverride, table);
     }
     if (parsed - done > kEntryAhead) {
       FWPrefetchEntry(&ring[(done + kEntryAhead) & (kRingSize - 1)]);

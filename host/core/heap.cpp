@@ -19,6 +19,7 @@
 #include "host/core/core_internal.h"
 #include "host/core/faults.h"
 #include "host/core/host_core.h"
+#include "host/core/slab.h"
 
 struct ZelHeap {
   static constexpr uint64_t kLive = 0x6c6976652d686570;
@@ -71,7 +72,7 @@ std::string ReleaseBlocksLocked(ZelHeap* heap) {
   if (heap->blocks.empty()) return {};
   std::string what = "heap " + heap->name + ": " + std::to_string(heap->stats.blocks) + " blocks, " +
                      std::to_string(heap->stats.bytes) + " bytes";
-  for (auto& [block, info] : heap->blocks) std::free(block);
+  for (auto& [block, info] : heap->blocks) SlabFree(block, info.size);
   heap->blocks.clear();
   heap->stats.blocks = 0;
   heap->stats.bytes = 0;
@@ -208,7 +209,7 @@ void* zel_HeapAllocWithRA(ZelHeapID heap, uint32_t size, void* ra) {
   host::Checked(h, "zel_HeapAllocWithRA");   // destroyed while we waited?
   host::HeapStats& st = h->stats;
   if (st.maximumSize != 0 && st.bytes + size > st.maximumSize) return nullptr;
-  void* block = std::malloc(std::max<uint32_t>(size, 1));
+  void* block = host::SlabAlloc(size);
   if (block == nullptr) return nullptr;
   std::memset(block, host::kGarbage, size);
   h->blocks.emplace(block, ZelHeap::Block{size, ra});
@@ -231,6 +232,7 @@ void zel_HeapFree(ZelHeapID heap, void* block) {
   }
   h->stats.blocks--;
   h->stats.bytes -= it->second.size;
+  const uint32_t size = it->second.size;
   h->blocks.erase(it);
-  std::free(block);
+  host::SlabFree(block, size);
 }

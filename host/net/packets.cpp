@@ -10,6 +10,13 @@
 // with a dead magic, so that a use or a second release of a recently
 // released packet is reported instead of reading reused memory.
 //
+// Layout follows the fast path, as a kernel's packet head does: what the
+// getters and list walks read fills the record's first cache line, and
+// element 0 of a frame up to kInlineFrameMax bytes follows it in the same
+// block (from the host's slab, slab.h), so the headers a filter parses sit
+// in the next line. Everything else (serial, frozen hash, the element
+// table) lives in a side record.
+//
 // Packet lists are doubly linked through the packets themselves, so every
 // list operation is O(1) per packet, and a packet knows the list it is in.
 // Lists and iterators are not locked: like the kernel's, a list belongs to
@@ -19,11 +26,13 @@
 #include <deque>
 #include <map>
 #include <mutex>
+#include <new>
 #include <set>
 #include <unordered_set>
 
 #include "host/core/faults.h"
 #include "host/core/host_core.h"
+#include "host/core/slab.h"
 #include "host/net/packets.h"
 
 namespace host {
@@ -42,17 +51,35 @@ constexpr uint64_t kMachineAddrKey = 0xa5c3000000000000ULL;
 
 constexpr size_t kQuarantineSize = 4096;
 
+// Element 0 of at most this many bytes lives in its packet's block.
+constexpr uint32_t kInlineFrameMax = 2048;
+
 }  // namespace
 
+// An element buffer: its own allocation, or (element 0 of a small frame)
+// the room behind its packet record, freed with the record.
+struct SgFree {
+  bool inRecord = false;
+  void operator()(uint8_t* p) const {
+    if (!inRecord) delete[] p;
+  }
+};
+
 struct PktSgBuffer {
-  std::unique_ptr<uint8_t[]> data;
+  std::unique_ptr<uint8_t[], SgFree> data;
   uint32_t length = 0;
   bool hidden = false;
 };
 
+struct PktCold {
+  uint64_t serial = 0;
+  uint64_t frozenHash = 0;  // frame hash of a read-only packet, checked on release
+  std::vector<PktSgBuffer> sg;
+};
+
 }  // namespace host
 
-struct ZelPkt {
+struct alignas(64) ZelPkt {
   uint64_t magic;
   uint8_t* mapped;          // element 0's buffer
   uint32_t frameLen;
@@ -61,13 +88,13 @@ struct ZelPkt {
   uint16_t resPoolTag;
   uint8_t priority;
   bool writable;
-  uint64_t serial;
-  uint64_t frozenHash;      // frame hash of a read-only packet, checked on release
+  uint16_t blockBytes;      // the record's block: record and inline element 0
   ZelPkt* next;             // list links, valid while `list` is set
   ZelPkt* prev;
   ZelPktList* list;
-  std::vector<host::PktSgBuffer> sg;
+  host::PktCold* cold;
 };
+static_assert(sizeof(ZelPkt) == 64, "the record is one cache line");
 
 struct ZelPktList {
   uint64_t magic;
@@ -130,31 +157,61 @@ inline ZelPktList* CheckedList(ZelPktList* list, const char* call) {
   return list;
 }
 
-inline ZelPktListIter* CheckedIter(ZelPktListIter* iter, const char* call) {
-  if (__builtin_expect(iter == nullptr || iter->magic != kIterMagic, 0)) {
-    Fatal("%s: %p is not a started packet list iterator", call, (void*)iter);
+[[noreturn]] __attribute__((noinline, cold)) void BadIter(const ZelPktListIter* iter,
+                                                       const char* call) {
+  if (iter == nullptr || iter->magic != kIterMagic) {
+    Fatal("%s: %p is not a started packet list iterator", call, (const void*)iter);
   }
-  // The current packet must still be where the iterator left it; a packet
-  // taken out of the list behind the iterator's back leaves it dangling.
+  if (iter->cur == nullptr) Fatal("%s: iterator is at the end", call);
+  Fatal("%s: the iterator's packet %p left its list", call, (const void*)iter->cur);
+}
+
+// The reads (at end, current packet) check the iterator only; every step
+// and change also checks that its packet is still in the list: a packet
+// taken out of the list behind the iterator's back leaves it dangling.
+inline ZelPktListIter* StartedIter(ZelPktListIter* iter, const char* call) {
+  if (__builtin_expect(iter == nullptr || iter->magic != kIterMagic, 0)) BadIter(iter, call);
+  return iter;
+}
+
+inline ZelPktListIter* CheckedIter(ZelPktListIter* iter, const char* call) {
+  StartedIter(iter, call);
   if (__builtin_expect(iter->cur != nullptr && iter->cur->list != iter->list, 0)) {
-    Fatal("%s: the iterator's packet %p left its list", call, (void*)iter->cur);
+    BadIter(iter, call);
+  }
+  return iter;
+}
+
+// An iterator standing on a packet of its list, about to step or change it.
+inline ZelPktListIter* CheckedIterOnPkt(ZelPktListIter* iter, const char* call) {
+  if (__builtin_expect(iter == nullptr || iter->magic != kIterMagic || iter->cur == nullptr ||
+                           iter->cur->list != iter->list,
+                       0)) {
+    BadIter(iter, call);
   }
   return iter;
 }
 
 uint64_t FrameHash(const ZelPkt* pkt) {
   uint64_t h = 0;
-  for (const PktSgBuffer& b : pkt->sg) h = h * 31 + HashFunc_HashBytes(b.data.get(), b.length);
+  for (const PktSgBuffer& b : pkt->cold->sg) h = h * 31 + HashFunc_HashBytes(b.data.get(), b.length);
   return h;
 }
 
 // A read-only packet whose bytes changed was written by someone who should
 // have made a copy first.
 void CheckNotWritten(const ZelPkt* pkt, const char* call) {
-  if (!pkt->writable && FrameHash(pkt) != pkt->frozenHash) {
+  if (!pkt->writable && FrameHash(pkt) != pkt->cold->frozenHash) {
     Fatal("%s: read-only packet %p (serial %llu) was written in place", call, (const void*)pkt,
-          (unsigned long long)pkt->serial);
+          (unsigned long long)pkt->cold->serial);
   }
+}
+
+void FreeRecord(ZelPkt* pkt) {
+  delete pkt->cold;
+  const size_t bytes = pkt->blockBytes;
+  pkt->~ZelPkt();
+  SlabFree(pkt, bytes);
 }
 
 struct Meta {
@@ -170,29 +227,40 @@ struct Meta {
 // element 0.
 ZelPkt* NewPacket(const uint8_t* frame, const std::vector<uint32_t>& sizes, uint32_t mappedLen,
                   const Meta& meta) {
-  ZelPkt* pkt = new ZelPkt{};
+  const uint32_t inlineLen = sizes[0] <= kInlineFrameMax ? std::max<uint32_t>(sizes[0], 1) : 0;
+  const uint32_t bytes = static_cast<uint32_t>(sizeof(ZelPkt)) + inlineLen;
+  void* block = SlabAlloc(bytes);
+  if (block == nullptr) Fatal("packets: out of memory");
+  ZelPkt* pkt = new (block) ZelPkt{};
+  pkt->blockBytes = static_cast<uint16_t>(bytes);
+  pkt->cold = new PktCold{};
   uint32_t off = 0;
   for (uint32_t size : sizes) {
     PktSgBuffer b;
-    b.data.reset(new uint8_t[std::max<uint32_t>(size, 1)]);
+    if (inlineLen != 0 && pkt->cold->sg.empty()) {
+      b.data = std::unique_ptr<uint8_t[], SgFree>(reinterpret_cast<uint8_t*>(pkt + 1),
+                                                  SgFree{true});
+    } else {
+      b.data.reset(new uint8_t[std::max<uint32_t>(size, 1)]);
+    }
     b.length = size;
     if (size != 0) std::memcpy(b.data.get(), frame + off, size);
     off += size;
-    pkt->sg.push_back(std::move(b));
+    pkt->cold->sg.push_back(std::move(b));
   }
   pkt->frameLen = off;
-  pkt->mapped = pkt->sg[0].data.get();
+  pkt->mapped = pkt->cold->sg[0].data.get();
   pkt->mappedLen = mappedLen;
   pkt->vlanId = meta.vlanId;
   pkt->priority = meta.priority;
   pkt->resPoolTag = meta.resPoolTag;
   pkt->writable = meta.writable;
-  if (!pkt->writable) pkt->frozenHash = FrameHash(pkt);
+  if (!pkt->writable) pkt->cold->frozenHash = FrameHash(pkt);
 
   Registry& reg = Reg();
   std::lock_guard<std::mutex> g(reg.mu);
-  pkt->serial = meta.serial != 0 ? meta.serial : reg.nextSerial++;
-  for (const PktSgBuffer& b : pkt->sg) {
+  pkt->cold->serial = meta.serial != 0 ? meta.serial : reg.nextSerial++;
+  for (const PktSgBuffer& b : pkt->cold->sg) {
     reg.elems[reinterpret_cast<uintptr_t>(b.data.get())] = ElemInfo{b.length, pkt};
   }
   reg.live.insert(pkt);
@@ -203,29 +271,29 @@ ZelPkt* NewPacket(const uint8_t* frame, const std::vector<uint32_t>& sizes, uint
 std::vector<uint8_t> Gather(const ZelPkt* pkt) {
   std::vector<uint8_t> out;
   out.reserve(pkt->frameLen);
-  for (const PktSgBuffer& b : pkt->sg) out.insert(out.end(), b.data.get(), b.data.get() + b.length);
+  for (const PktSgBuffer& b : pkt->cold->sg) out.insert(out.end(), b.data.get(), b.data.get() + b.length);
   return out;
 }
 
 std::vector<uint32_t> Sizes(const ZelPkt* pkt) {
   std::vector<uint32_t> sizes;
-  for (const PktSgBuffer& b : pkt->sg) sizes.push_back(b.length);
+  for (const PktSgBuffer& b : pkt->cold->sg) sizes.push_back(b.length);
   return sizes;
 }
 
 Meta MetaOf(const ZelPkt* pkt) {
-  return Meta{pkt->vlanId, pkt->priority, pkt->resPoolTag, pkt->writable, pkt->serial};
+  return Meta{pkt->vlanId, pkt->priority, pkt->resPoolTag, pkt->writable, pkt->cold->serial};
 }
 
 void ReleaseLocked(Registry& reg, ZelPkt* pkt) {
-  for (const PktSgBuffer& b : pkt->sg) reg.elems.erase(reinterpret_cast<uintptr_t>(b.data.get()));
-  pkt->sg.clear();
-  pkt->sg.shrink_to_fit();
+  for (const PktSgBuffer& b : pkt->cold->sg) reg.elems.erase(reinterpret_cast<uintptr_t>(b.data.get()));
+  pkt->cold->sg.clear();
+  pkt->cold->sg.shrink_to_fit();
   pkt->mapped = nullptr;
   pkt->magic = kDeadPktMagic;
   reg.quarantine.push_back(pkt);
   if (reg.quarantine.size() > kQuarantineSize) {
-    delete reg.quarantine.front();
+    FreeRecord(reg.quarantine.front());
     reg.quarantine.pop_front();
   }
 }
@@ -255,13 +323,13 @@ void ResetPackets() {
   std::lock_guard<std::mutex> g(reg.mu);
   // Lists of tests are emptied first so that none points at a freed packet.
   for (PacketList* l : reg.testLists) zel_PktListInit(l->get());
-  for (ZelPkt* pkt : reg.resetGraveyard) delete pkt;
+  for (ZelPkt* pkt : reg.resetGraveyard) FreeRecord(pkt);
   reg.resetGraveyard.clear();
   // Packets still live are freed, but their records are kept until the next
   // reset with a magic that makes a late zel_PktRelease (from a subsystem
   // reset that runs after this one) harmless.
   for (ZelPkt* pkt : reg.live) {
-    pkt->sg.clear();
+    pkt->cold->sg.clear();
     pkt->mapped = nullptr;
     pkt->list = nullptr;
     pkt->magic = kResetPktMagic;
@@ -269,7 +337,7 @@ void ResetPackets() {
   }
   reg.live.clear();
   reg.elems.clear();
-  for (ZelPkt* pkt : reg.quarantine) delete pkt;
+  for (ZelPkt* pkt : reg.quarantine) FreeRecord(pkt);
   reg.quarantine.clear();
 }
 
@@ -278,7 +346,7 @@ void PacketLeftovers(std::vector<std::string>* out) {
   std::lock_guard<std::mutex> g(reg.mu);
   if (reg.live.empty()) return;
   std::vector<uint64_t> serials;
-  for (ZelPkt* pkt : reg.live) serials.push_back(pkt->serial);
+  for (ZelPkt* pkt : reg.live) serials.push_back(pkt->cold->serial);
   std::sort(serials.begin(), serials.end());
   std::string text = std::to_string(serials.size()) + " live packet(s), serials";
   for (size_t i = 0; i < serials.size() && i < 16; i++) {
@@ -330,7 +398,7 @@ std::vector<uint8_t> Packets::Frame(ZelPkt* pkt) {
 uint16_t Packets::VlanId(ZelPkt* pkt) { return CHECK_PKT(pkt)->vlanId; }
 uint8_t Packets::Priority(ZelPkt* pkt) { return CHECK_PKT(pkt)->priority; }
 uint16_t Packets::ResPoolTag(ZelPkt* pkt) { return CHECK_PKT(pkt)->resPoolTag; }
-uint64_t Packets::Serial(ZelPkt* pkt) { return CHECK_PKT(pkt)->serial; }
+uint64_t Packets::Serial(ZelPkt* pkt) { return CHECK_PKT(pkt)->cold->serial; }
 
 bool Packets::IsLive(ZelPkt* pkt) {
   Registry& reg = Reg();
@@ -346,8 +414,8 @@ uint64_t Packets::Live() {
 
 void Packets::HideSgElement(ZelPkt* pkt, uint16_t index) {
   CHECK_PKT(pkt);
-  if (index >= pkt->sg.size()) Fatal("Packets::HideSgElement: packet has no element %u", index);
-  pkt->sg[index].hidden = true;
+  if (index >= pkt->cold->sg.size()) Fatal("Packets::HideSgElement: packet has no element %u", index);
+  pkt->cold->sg[index].hidden = true;
 }
 
 bool Packets::InList(ZelPkt* pkt) { return CHECK_PKT(pkt)->list != nullptr; }
@@ -421,14 +489,15 @@ void zel_PktListIterStart(ZelPktList* list, ZelPktListIter* iter) {
 }
 
 bool zel_PktListIterIsAtEnd(ZelPktListIter* iter) {
-  return CheckedIter(iter, __func__)->cur == nullptr;
+  return host::StartedIter(iter, __func__)->cur == nullptr;
 }
 
-ZelPkt* zel_PktListIterGetPkt(ZelPktListIter* iter) { return CheckedIter(iter, __func__)->cur; }
+ZelPkt* zel_PktListIterGetPkt(ZelPktListIter* iter) {
+  return host::StartedIter(iter, __func__)->cur;
+}
 
 void zel_PktListIterMove(ZelPktListIter* iter) {
-  CheckedIter(iter, __func__);
-  if (iter->cur == nullptr) Fatal("zel_PktListIterMove: iterator is at the end");
+  host::CheckedIterOnPkt(iter, __func__);
   iter->cur = iter->cur->next;
 }
 
@@ -553,7 +622,7 @@ ZelStatus zel_PktPartialCopy(ZelPkt* pkt, uint32_t len, ZelPkt** copy) {
   // original element boundaries.
   std::vector<uint32_t> sizes{len};
   uint32_t start = 0;
-  for (const host::PktSgBuffer& b : pkt->sg) {
+  for (const host::PktSgBuffer& b : pkt->cold->sg) {
     uint32_t end = start + b.length;
     if (end > len) sizes.push_back(end - std::max(start, len));
     start = end;
@@ -569,7 +638,7 @@ void zel_PktRelease(ZelPkt* pkt) {
     if (pkt != nullptr && pkt->magic == host::kResetPktMagic) return;  // already freed by Reset
     if (pkt != nullptr && pkt->magic == host::kDeadPktMagic) {
       Fatal("zel_PktRelease: packet released twice (%p, serial %llu)", (void*)pkt,
-            (unsigned long long)pkt->serial);
+            (unsigned long long)pkt->cold->serial);
     }
     Fatal("zel_PktRelease: %p is not a live packet", (void*)pkt);
   }
@@ -585,15 +654,15 @@ void zel_PktRelease(ZelPkt* pkt) {
 // Scatter-gather elements
 
 uint16_t zel_PktSgArrayGet(ZelPkt* pkt) {
-  return static_cast<uint16_t>(Checked(pkt, __func__)->sg.size());
+  return static_cast<uint16_t>(Checked(pkt, __func__)->cold->sg.size());
 }
 
 ZelStatus zel_PktSgElemGet(ZelPkt* pkt, uint16_t index, ZelSgElem* elem) {
   if (ZelStatus s = Faults::Check("zel_PktSgElemGet")) return s;
   Checked(pkt, __func__);
   if (elem == nullptr) return ZEL_BAD_PARAM;
-  if (index >= pkt->sg.size() || pkt->sg[index].hidden) return ZEL_NOT_FOUND;
-  const host::PktSgBuffer& b = pkt->sg[index];
+  if (index >= pkt->cold->sg.size() || pkt->cold->sg[index].hidden) return ZEL_NOT_FOUND;
+  const host::PktSgBuffer& b = pkt->cold->sg[index];
   elem->machineAddr = reinterpret_cast<uintptr_t>(b.data.get()) ^ host::kMachineAddrKey;
   elem->length = b.length;
   return ZEL_OK;
