@@ -487,8 +487,18 @@ ZelStatus FWStageAdd(SLCGenericFilter* filter, FWFilterContext* ctx, FWRuleset* 
 // holds the former table and index, whose entries the copies replaced:
 // FWReleaseReplaced frees them once no packet can see them.
 void FWCommitStaged(FWFilterContext* ctx, const FWRuleset* ruleset, FWStagedAdd* staged) {
-  // What walks changed on the originals since they were copied.
+  // What walks changed on the originals since they were copied. Both
+  // records are cache-cold in a large table: fetched a few pairs ahead.
+  constexpr uint32_t kAhead = 8;
   for (uint32_t i = 0; i < staged->numCopies; i++) {
+    if (i + kAhead < staged->numCopies) {
+      const FWRuleEntry* from = staged->originals[i + kAhead];
+      const FWRuleEntry* to = staged->copies[i + kAhead];
+      __builtin_prefetch(&from->rule.pktCount);
+      __builtin_prefetch(&from->greSocket);
+      __builtin_prefetch(&to->rule.pktCount, 1);
+      __builtin_prefetch(&to->greSocket, 1);
+    }
     const FWRuleEntry* from = staged->originals[i];
     FWRuleEntry* to = staged->copies[i];
     to->rule.pktCount = from->rule.pktCount;
