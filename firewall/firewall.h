@@ -113,8 +113,8 @@ bool FWIterRulesetGet(void* entry, void* ruleset);
 // counters and GRE sockets the packet path changed meanwhile and swaps.
 // Rules changed by another writer between the two holds are noticed
 // (FWFilterContext::generation): the addition is staged again, and built
-// under the exclusive hold if they changed again. Same outcome, status and
-// logs as FWApplyRuleset.
+// under the exclusive hold if they changed again. Same outcome and status
+// as FWApplyRuleset, and the same logs but for one line per stale staging.
 [[nodiscard]] ZelStatus FWAddRuleset(SLCGenericFilter* filter, FWRuleset* ruleset,
                                      uint32_t fromIoctl);
 // Called by FWAddRuleset between releasing the shared hold and taking the
