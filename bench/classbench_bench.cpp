@@ -35,6 +35,16 @@
 //                                 prepared 0: the whole application under
 //                                 the hold
 //   BM_ExactApplyHold/<rules>     exact rules replace as many others
+// and while rules are added to those in force (replace 0):
+//   BM_AddHold/<rules>/<prepared> 10,000 other general rules added to
+//                                 <rules> (the filter reset to those
+//                                 before each round, outside the timing);
+//                                 prepared 1: the ioctl road
+//                                 (FWSetIoctlRuleset: built under the
+//                                 shared hold, the exclusive hold a swap);
+//                                 prepared 0: FWApplyRuleset under the hold
+//   BM_ExactAddHold/<rules>/<prepared>   10,000 new exact rules added to
+//                                 <rules> exact ones, the same two roads
 // Counters: hold_ms, the longest exclusive hold of configLock (the host
 // times every write hold); stall_ms, the longest call of the packet thread
 // while rules were replaced (its list's own time included, a few
@@ -54,6 +64,7 @@
 
 #include <benchmark/benchmark.h>
 
+#include <algorithm>
 #include <cstdio>
 #include <atomic>
 #include <memory>
@@ -242,6 +253,64 @@ HoldResult MeasureHold(void* priv, std::vector<std::unique_ptr<host::PacketList>
           static_cast<double>(host::Locks::LongestWriteHoldNs("slcg.fw.config")) / 1e6};
 }
 
+// Resets the rules of `priv` to `base`, then adds `extra` to them (replace
+// 0), `rounds` times, while another thread sends `lists` through the packet
+// path. Only the additions are measured: the longest exclusive hold among
+// them, the longest packet call during them, and the mean addition.
+HoldResult MeasureAddHold(void* priv, std::vector<std::unique_ptr<host::PacketList>>& lists,
+                          const std::vector<uint8_t>& base, const std::vector<uint8_t>& extra,
+                          bool prepared, int rounds) {
+  auto* filter = static_cast<SLCGenericFilter*>(priv);
+  std::atomic<bool> stop{false}, applying{false};
+  std::atomic<double> worst{0};
+  std::thread packets([&] {
+    size_t next = 0;
+    while (!stop.load(std::memory_order_relaxed)) {
+      const bool during = applying.load(std::memory_order_acquire);
+      const double t0 = now_ns();
+      (void)SLCGenericProcessPackets(priv, lists[next]->get(), 1);
+      const double took = now_ns() - t0;
+      if ((during || applying.load(std::memory_order_acquire)) && took > worst.load()) {
+        worst.store(took);
+      }
+      if (++next == lists.size()) next = 0;
+    }
+  });
+  double total = 0;
+  uint64_t longest = 0;
+  for (int r = 0; r < rounds; r++) {
+    std::vector<uint8_t> reset(base);
+    if (FWSetIoctlRuleset(filter, reinterpret_cast<FWRuleset*>(reset.data()), 1) != ZEL_OK) {
+      std::fprintf(stderr, "reset failed\n");
+      std::abort();
+    }
+    std::this_thread::sleep_for(std::chrono::milliseconds(2));
+    std::vector<uint8_t> copy(extra);
+    auto* rs = reinterpret_cast<FWRuleset*>(copy.data());
+    host::Locks::ResetWriteHolds("slcg.fw.config");
+    applying.store(true, std::memory_order_release);
+    const double t0 = now_ns();
+    ZelStatus st;
+    if (prepared) {
+      st = FWSetIoctlRuleset(filter, rs, 0);
+    } else {
+      SLCGenericWriteGuard guard(FWContext(filter)->configLock);
+      st = FWApplyRuleset(filter, rs, 0, 1);
+    }
+    total += now_ns() - t0;
+    std::this_thread::sleep_for(std::chrono::milliseconds(2));  // the stalled call ends
+    applying.store(false, std::memory_order_release);
+    longest = std::max(longest, host::Locks::LongestWriteHoldNs("slcg.fw.config"));
+    if (st != ZEL_OK) {
+      std::fprintf(stderr, "addition failed\n");
+      std::abort();
+    }
+  }
+  stop.store(true);
+  packets.join();
+  return {worst.load() / 1e6, total / rounds / 1e6, static_cast<double>(longest) / 1e6};
+}
+
 class Bench {
  public:
   Bench(uint32_t n, bool mixed, bool scanOnly) : n_(n), mixed_(mixed), scanOnly_(scanOnly) {
@@ -361,8 +430,19 @@ class Bench {
     return MeasureHold(priv_, lists_, other_, ruleset_, prepared, 10);
   }
 
+  // 10,000 other general rules added to this bench's own.
+  HoldResult AddHold(bool prepared) {
+    if (added_.empty()) {
+      const std::vector<Rule4> rules = gen_rules(10000, 0xadd50000ull + n_);
+      rules::RulesetBuilder builder(8);
+      for (const Rule4& x : rules) builder.Add(RecordOf(x));
+      added_ = builder.Bytes();
+    }
+    return MeasureAddHold(priv_, lists_, ruleset_, added_, prepared, 4);
+  }
+
  private:
-  std::vector<uint8_t> other_;
+  std::vector<uint8_t> other_, added_;
   std::vector<FWRuleEntry*> Entries() {
     std::vector<FWRuleEntry*> v;
     FWFilterContext* ctx = FWContext(static_cast<SLCGenericFilter*>(priv_));
@@ -538,6 +618,23 @@ class ExactBench {
     return MeasureHold(priv_, lists_, other.Bytes(), mine.Bytes(), true, 4);
   }
 
+  // `added` flows beyond the installed ones added to them.
+  HoldResult AddHold(uint32_t added, bool prepared) {
+    FWRule rule = rules::ParseRule(
+        "action=accept dmac=02:00:00:00:00:02 smac=02:00:00:00:00:01 ethtype=0x0800 "
+        "vlan=none sa=10.0.0.0 da=192.168.0.1 proto=tcp sport=1234 dport=80");
+    rules::RulesetBuilder mine(8), extra(8);
+    for (uint32_t i = 0; i < n_; i++) {
+      PutNet32(rule.ipSa, FlowKey(i).src);
+      mine.Add(rule);
+    }
+    for (uint32_t i = 0; i < added; i++) {
+      PutNet32(rule.ipSa, FlowKey(n_ + i).src);
+      extra.Add(rule);
+    }
+    return MeasureAddHold(priv_, lists_, mine.Bytes(), extra.Bytes(), prepared, 3);
+  }
+
   void RunOne() {
     host::PacketList& list = *lists_[next_];
     if (++next_ == lists_.size()) next_ = 0;
@@ -599,6 +696,31 @@ void BM_ExactApplyHold(benchmark::State& state) {
   state.counters["apply_ms"] = r.applyMs;
 }
 BENCHMARK(BM_ExactApplyHold)->Arg(100000)->Iterations(1)->UseRealTime();
+
+void BM_AddHold(benchmark::State& state) {
+  Bench& b = Use(static_cast<uint32_t>(state.range(0)), false);
+  HoldResult r{};
+  for (auto _ : state) r = b.AddHold(state.range(1) != 0);
+  state.counters["stall_ms"] = r.stallMs;
+  state.counters["hold_ms"] = r.holdMs;
+  state.counters["apply_ms"] = r.applyMs;
+}
+BENCHMARK(BM_AddHold)->Args({10000, 0})->Args({10000, 1})->Iterations(1)->UseRealTime();
+
+void BM_ExactAddHold(benchmark::State& state) {
+  const uint32_t n = static_cast<uint32_t>(state.range(0));
+  current.reset();
+  if (!exactBench || !exactBench->Is(n)) {
+    exactBench.reset();
+    exactBench = std::make_unique<ExactBench>(n);
+  }
+  HoldResult r{};
+  for (auto _ : state) r = exactBench->AddHold(10000, state.range(1) != 0);
+  state.counters["stall_ms"] = r.stallMs;
+  state.counters["hold_ms"] = r.holdMs;
+  state.counters["apply_ms"] = r.applyMs;
+}
+BENCHMARK(BM_ExactAddHold)->Args({100000, 0})->Args({100000, 1})->Iterations(1)->UseRealTime();
 
 #ifdef SLC_HAVE_DPDK
 // The peer classifier on the generator's rules: five fields (protocol as a

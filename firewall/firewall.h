@@ -40,6 +40,9 @@ struct FWFilterContext {
   uint32_t ioctl;              // 1 once a ruleset came by an ioctl road; never cleared
   FWScanIndex* scanIndex;      // the entries of ruleList in ruleset order, for the scan;
                                // rebuilt with ruleList, owned by the context
+  uint32_t generation;         // raised by every change of the rules (table, list, index);
+                               // an addition staged under the shared hold is swapped in
+                               // only if it still reads the value it was built from
 };
 
 inline FWFilterContext* FWContext(SLCGenericFilter* filter) {
@@ -103,6 +106,21 @@ bool FWIterRulesetGet(void* entry, void* ruleset);
 // released after it. Same outcome, status and logs as FWApplyRuleset.
 [[nodiscard]] ZelStatus FWReplaceRuleset(SLCGenericFilter* filter, FWRuleset* ruleset,
                                          uint32_t fromIoctl);
+// FWApplyRuleset with replace = 0 for a caller holding no lock: the new
+// table (with copies of the former exact entries), the new general entries
+// and the scan index of all general rules are built while configLock is
+// held shared, so packets keep flowing; the exclusive hold takes over the
+// counters and GRE sockets the packet path changed meanwhile and swaps.
+// Rules changed by another writer between the two holds are noticed
+// (FWFilterContext::generation): the addition is staged again, and built
+// under the exclusive hold if they changed again. Same outcome and status
+// as FWApplyRuleset, and the same logs but for one line per stale staging.
+[[nodiscard]] ZelStatus FWAddRuleset(SLCGenericFilter* filter, FWRuleset* ruleset,
+                                     uint32_t fromIoctl);
+// Called by FWAddRuleset between releasing the shared hold and taking the
+// exclusive one, with no lock held; null outside tests, which use it to
+// change the rules there.
+extern void (*g_fwAddBetweenHolds)(SLCGenericFilter* filter);
 // Writes the rules in force; the buffer holds 15 + 281 * numRules bytes.
 void FWPopulateRuleset(FWFilterContext* ctx, FWRuleset* ruleset);
 void FWClearRules(FWFilterContext* ctx);
@@ -163,7 +181,7 @@ const uint8_t* SLCGenericFindSGEntry(ZelPkt* pkt, uint32_t start, uint32_t end);
 void FWFilterIoctlRequest(SLCGenericFilter* filter, uint32_t requestCode, void* payload,
                           uint64_t payloadLen);
 // Applies `ruleset` with fromIoctl = 1; takes configLock itself (a
-// replacement through FWReplaceRuleset).
+// replacement through FWReplaceRuleset, an addition through FWAddRuleset).
 [[nodiscard]] ZelStatus FWSetIoctlRuleset(SLCGenericFilter* filter, FWRuleset* ruleset,
                                           uint32_t replace);
 

@@ -9,13 +9,27 @@
 //     swaps the staged rules with those in force (no allocation, nothing
 //     can fail). The former rules are released after the hold. A failed
 //     build releases what it made; the filter was never touched;
-//   - add: under the hold, a new exact-rule table sized for everything the
-//     filter will hold takes copies of the former entries (copies share
-//     the originals' sockets and tags; whichever record survives owns them)
-//     and the new general rules are linked in front of the former ones;
-//     the context is snapshotted first and put back on failure. Success
-//     installs a new scan index (fw_index.h), allocated last, and frees
-//     only the memory of the originals.
+//   - add: a new exact-rule table sized for everything the filter will
+//     hold takes copies of the former entries (copies share the originals'
+//     sockets and tags; whichever record survives owns them), the new
+//     general rules are linked in front of the former ones, and a new scan
+//     index (fw_index.h) covers both. Success frees only the memory of the
+//     originals. Two roads:
+//       - staged (FWAddRuleset, the ioctl push): all of it is built while
+//         configLock is held shared, beside the rules in force, which it
+//         only reads: packets keep flowing, writers wait. The copies leave
+//         out what walks change under the shared hold (counters, the GRE
+//         socket); the exclusive hold takes those over from the originals
+//         (a walk over the copies, no allocation), links the new general
+//         entries in and swaps table and index. If another writer changed
+//         the rules between the two holds (FWFilterContext::generation),
+//         the staged rules are thrown away and the addition staged again,
+//         then built under the hold if the rules changed once more. A
+//         failed build releases what it made; the filter was never
+//         touched;
+//       - in place (FWApplyRuleset, for callers holding the lock): the
+//         same under the exclusive hold; the context is snapshotted first
+//         and put back on failure.
 //
 // Resource-pool tags. Every tag obtained from the host is handed back
 // exactly once, so that undoing or re-applying rulesets never leaks one:
@@ -33,8 +47,12 @@
 //     copies at all. Undo is rare, so the extra probe per entry is cheap.
 //
 // Every function here runs with the filter's configLock held exclusively,
-// except FWPopulateRuleset (shared suffices), FWReplaceRuleset (takes it)
-// and the staging of a replacement (no lock: it touches no filter state).
+// except FWPopulateRuleset (shared suffices), FWReplaceRuleset and
+// FWAddRuleset (take it), the staging of a replacement (no lock: it touches
+// no filter state) and the staging of an addition (shared).
+//
+// Every change of the rules in force raises ctx->generation, under the
+// exclusive hold.
 
 #include "firewall/fw_index.h"
 
@@ -277,6 +295,7 @@ void FWSwapStaged(FWFilterContext* ctx, FWFilterContext* staged) {
   ctx->fragOverride = staged->fragOverride;
   ctx->version = staged->version;
   ctx->fwFeatures = staged->fwFeatures;
+  ctx->generation++;
 }
 
 // Once a ruleset came by an ioctl road, the property and restores are
@@ -285,11 +304,12 @@ bool FWIgnored(const FWFilterContext* ctx, uint32_t fromIoctl) {
   return ctx->ioctl != 0 && fromIoctl == 0;
 }
 
-// Adds `ruleset` to the rules in force. A new table, sized for both, takes
-// copies of the former entries; the new general rules are linked in front
-// of the former ones. configLock held exclusively.
-ZelStatus FWAddRuleset(SLCGenericFilter* filter, FWFilterContext* ctx, FWRuleset* ruleset) {
-  if (ZelStatus s = FWCheckVersion(filter, ruleset, 0)) return s;
+// Adds `ruleset` (its version checked) to the rules in force, in place. A
+// new table, sized for both, takes copies of the former entries; the new
+// general rules are linked in front of the former ones. configLock held
+// exclusively.
+ZelStatus FWAddInPlace(SLCGenericFilter* filter, FWFilterContext* ctx, FWRuleset* ruleset) {
+  ctx->generation++;
   const uint32_t version = ruleset->version;
   const uint32_t numRecords = ruleset->numRules;
 
@@ -354,14 +374,190 @@ ZelStatus FWAddRuleset(SLCGenericFilter* filter, FWFilterContext* ctx, FWRuleset
   return ZEL_FAILURE;
 }
 
+// --- The staged addition ------------------------------------------------
+
+// An addition built beside the rules in force. `rules` is a context no
+// packet sees: its table holds copies of the former exact entries and the
+// new exact entries, its list the new general entries (newest at the
+// front, as ruleList), its index the former general entries followed by the
+// new ones, its numRules the entries created. copies[i] was made of
+// originals[i].
+struct FWStagedAdd {
+  FWFilterContext rules;
+  FWRuleEntry** originals;  // one block: numCopies originals, then the copies
+  FWRuleEntry** copies;
+  uint32_t numCopies;
+  uint32_t capacity;
+  uint32_t generation;  // of the rules in force it was built from
+};
+
+// Everything the counters and the GRE socket are not: what walks never
+// change, copied under the shared hold without reading what they write.
+constexpr size_t kCountersAt = offsetof(FWRule, pktCount);
+constexpr size_t kAfterCounters = offsetof(FWRule, byteCount) + sizeof(uint64_t);
+static_assert(offsetof(FWRule, byteCount) == kCountersAt + sizeof(uint64_t));
+
+bool FWIterStageCopy(void* elem, void* arg) {
+  auto* staged = static_cast<FWStagedAdd*>(arg);
+  const auto* from = static_cast<const FWRuleEntry*>(elem);
+  // The former table holds at most numRules entries, the block's size.
+  if (staged->numCopies == staged->capacity) return false;
+  auto* copy = static_cast<FWRuleEntry*>(SLCGenericAlloc(sizeof(FWRuleEntry)));
+  if (copy == nullptr) return false;
+  copy->hash = from->hash;
+  auto* to = reinterpret_cast<uint8_t*>(&copy->rule);
+  const auto* src = reinterpret_cast<const uint8_t*>(&from->rule);
+  zel_Memcpy(to, src, kCountersAt);
+  copy->rule.pktCount = 0;
+  copy->rule.byteCount = 0;
+  zel_Memcpy(to + kAfterCounters, src + kAfterCounters, sizeof(FWRule) - kAfterCounters);
+  copy->greSocket = 0;
+  copy->greSocketOpen = 0;
+  copy->poolTag = from->poolTag;
+  FWHashLinkEntry(staged->rules.ruleHash, copy);
+  staged->originals[staged->numCopies] = const_cast<FWRuleEntry*>(from);
+  staged->copies[staged->numCopies] = copy;
+  staged->numCopies++;
+  return true;
+}
+
+// Releases what a staging made: copies by their memory only (the originals
+// own sockets and tags), created entries in full. Never touches the rules
+// in force, which may have changed since.
+void FWReleaseStaged(FWStagedAdd* staged) {
+  for (uint32_t i = 0; i < staged->numCopies; i++) {
+    List_Remove(&staged->copies[i]->link);
+    SLCGenericFree(staged->copies[i]);
+  }
+  staged->numCopies = 0;
+  FWClearRules(&staged->rules);
+  if (staged->originals != nullptr) {
+    SLCGenericFree(staged->originals);
+    staged->originals = nullptr;
+  }
+}
+
+// Builds the addition of `ruleset` (its version checked) beside the rules
+// in force; configLock held shared. ZEL_OK, or ZEL_FAILURE with everything
+// it made released.
+ZelStatus FWStageAdd(SLCGenericFilter* filter, FWFilterContext* ctx, FWRuleset* ruleset,
+                     FWStagedAdd* staged) {
+  *staged = FWStagedAdd{};
+  List_Init(&staged->rules.ruleList);
+  staged->generation = ctx->generation;
+  const uint32_t version = ruleset->version;
+  const uint32_t numRecords = ruleset->numRules;
+  staged->rules.ruleHash = FWAllocRuleHash(numRecords + ctx->numRules);
+  if (staged->rules.ruleHash == nullptr) {
+    SLCG_LOG_OBJ(SLCG_ATTENTION, filter->name, "Failed to allocate firewall ruleset hash");
+    return ZEL_FAILURE;
+  }
+
+  bool ok = true;
+  if (ctx->ruleHash != nullptr && ctx->numRules != 0) {
+    const uint64_t bytes = 2ull * ctx->numRules * sizeof(FWRuleEntry*);
+    auto* block = bytes <= UINT32_MAX
+                      ? static_cast<FWRuleEntry**>(SLCGenericAlloc(static_cast<uint32_t>(bytes)))
+                      : nullptr;
+    staged->originals = block;
+    staged->copies = block == nullptr ? nullptr : block + ctx->numRules;
+    staged->capacity = block == nullptr ? 0 : ctx->numRules;
+    if (block == nullptr || !Hash_IterateWithCheck(ctx->ruleHash, FWIterStageCopy, staged)) {
+      SLCG_LOG_OBJ(SLCG_ATTENTION, filter->name, "Failed to copy hash entries");
+      ok = false;
+    }
+  }
+
+  uint32_t k = 0;
+  ok = ok && FWInstallRecords(filter, &staged->rules, version, ruleset, numRecords, &k);
+  if (ok && FWScanIndexBuild(&ctx->ruleList, &staged->rules.scanIndex,
+                             &staged->rules.ruleList) != ZEL_OK) {
+    SLCG_LOG_OBJ(SLCG_ATTENTION, filter->name, "Failed to allocate general rule index");
+    ok = false;
+  }
+  if (ok) return ZEL_OK;
+
+  SLCG_LOG_OBJ(SLCG_ATTENTION, filter->name, "Undoing ...");
+  FWReleaseStaged(staged);
+  return ZEL_FAILURE;
+}
+
+// Puts a staged addition in force (configLock held exclusively, the rules
+// unchanged since it was built). Allocates nothing. Afterwards `staged`
+// holds the former table and index, whose entries the copies replaced:
+// FWReleaseReplaced frees them once no packet can see them.
+void FWCommitStaged(FWFilterContext* ctx, const FWRuleset* ruleset, FWStagedAdd* staged) {
+  // What walks changed on the originals since they were copied. Both
+  // records are cache-cold in a large table: fetched a few pairs ahead.
+  constexpr uint32_t kAhead = 8;
+  for (uint32_t i = 0; i < staged->numCopies; i++) {
+    if (i + kAhead < staged->numCopies) {
+      const FWRuleEntry* from = staged->originals[i + kAhead];
+      const FWRuleEntry* to = staged->copies[i + kAhead];
+      __builtin_prefetch(&from->rule.pktCount);
+      __builtin_prefetch(&from->greSocket);
+      __builtin_prefetch(&to->rule.pktCount, 1);
+      __builtin_prefetch(&to->greSocket, 1);
+    }
+    const FWRuleEntry* from = staged->originals[i];
+    FWRuleEntry* to = staged->copies[i];
+    to->rule.pktCount = from->rule.pktCount;
+    to->rule.byteCount = from->rule.byteCount;
+    to->greSocket = from->greSocket;
+    to->greSocketOpen = from->greSocketOpen;
+  }
+  staged->numCopies = 0;  // the copies are in force now
+
+  // The new general entries in front of the former ones.
+  FWFilterContext& rules = staged->rules;
+  List_Append(&rules.ruleList, &ctx->ruleList);
+  List_Append(&ctx->ruleList, &rules.ruleList);
+
+  Hash_Table* table = ctx->ruleHash;
+  ctx->ruleHash = rules.ruleHash;
+  rules.ruleHash = table;
+  FWScanIndex* index = ctx->scanIndex;
+  ctx->scanIndex = rules.scanIndex;
+  rules.scanIndex = index;
+  ctx->numRules += rules.numRules;
+  rules.numRules = 0;
+  ctx->fragOverride = ruleset->fragOverride;
+  ctx->version = ruleset->version;
+  ctx->fwFeatures = ruleset->fwFeatures;
+  ctx->generation++;
+}
+
+// Frees what an addition replaced: the former index, and the former table
+// with the memory of its entries (their copies own sockets and tags).
+void FWReleaseReplaced(FWStagedAdd* staged) {
+  FWScanIndexFree(&staged->rules.scanIndex);
+  if (staged->rules.ruleHash != nullptr) {
+    Hash_Iterate(staged->rules.ruleHash, FWIterFreeCopy, staged->rules.ruleHash);
+    Hash_Free(staged->rules.ruleHash);
+    staged->rules.ruleHash = nullptr;
+  }
+  if (staged->originals != nullptr) {
+    SLCGenericFree(staged->originals);
+    staged->originals = nullptr;
+  }
+}
+
+// Stagings tried before the addition is built under the exclusive hold.
+constexpr int kStagingAttempts = 2;
+
 }  // namespace
+
+void (*g_fwAddBetweenHolds)(SLCGenericFilter* filter) = nullptr;
 
 ZelStatus FWApplyRuleset(SLCGenericFilter* filter, FWRuleset* ruleset, uint32_t replace,
                          uint32_t fromIoctl) {
   FWFilterContext* ctx = FWContext(filter);
   if (FWIgnored(ctx, fromIoctl)) return ZEL_OK;
   ctx->ioctl = fromIoctl ? 1 : 0;
-  if (replace == 0) return FWAddRuleset(filter, ctx, ruleset);
+  if (replace == 0) {
+    if (ZelStatus s = FWCheckVersion(filter, ruleset, 0)) return s;
+    return FWAddInPlace(filter, ctx, ruleset);
+  }
   FWFilterContext staged;
   const ZelStatus status = FWStageRuleset(filter, ruleset, &staged);
   if (status != ZEL_OK) return status;
@@ -394,6 +590,55 @@ ZelStatus FWReplaceRuleset(SLCGenericFilter* filter, FWRuleset* ruleset, uint32_
   return status;
 }
 
+ZelStatus FWAddRuleset(SLCGenericFilter* filter, FWRuleset* ruleset, uint32_t fromIoctl) {
+  FWFilterContext* ctx = FWContext(filter);
+  {
+    // As for a replacement: skip the build when the outcome is known.
+    SLCGenericReadGuard peek(ctx->configLock);
+    if (FWIgnored(ctx, fromIoctl)) return ZEL_OK;
+  }
+  const ZelStatus checked = FWCheckVersion(filter, ruleset, 0);
+  for (int attempt = 1;; attempt++) {
+    FWStagedAdd staged{};
+    ZelStatus status = checked;
+    bool built = false;
+    if (status == ZEL_OK) {
+      SLCGenericReadGuard shared(ctx->configLock);
+      status = FWStageAdd(filter, ctx, ruleset, &staged);
+      built = status == ZEL_OK;
+    }
+    if (built && g_fwAddBetweenHolds != nullptr) g_fwAddBetweenHolds(filter);
+    bool committed = false, again = false;
+    {
+      SLCGenericWriteGuard hold(ctx->configLock);
+      if (FWIgnored(ctx, fromIoctl)) {
+        status = ZEL_OK;  // staged rules (if any) released below
+      } else {
+        ctx->ioctl = fromIoctl ? 1 : 0;
+        if (built && staged.generation == ctx->generation) {
+          FWCommitStaged(ctx, ruleset, &staged);
+          committed = true;
+        } else if (built) {
+          SLCG_LOG_OBJ(SLCG_PROGRESS, filter->name,
+                       "Firewall rules changed while rules to add were built");
+          if (attempt < kStagingAttempts) {
+            again = true;
+          } else {
+            status = FWAddInPlace(filter, ctx, ruleset);
+          }
+        }
+      }
+    }
+    // After the hold: no packet sees these any more (or ever did).
+    if (committed) {
+      FWReleaseReplaced(&staged);
+    } else if (built) {
+      FWReleaseStaged(&staged);
+    }
+    if (!again) return status;
+  }
+}
+
 void FWPopulateRuleset(FWFilterContext* ctx, FWRuleset* ruleset) {
   ruleset->version = static_cast<uint8_t>(ctx->version);
   ruleset->highestSupportedVersion = FW_RULESET_VERSION_8;
@@ -409,6 +654,7 @@ void FWPopulateRuleset(FWFilterContext* ctx, FWRuleset* ruleset) {
 }
 
 void FWClearRules(FWFilterContext* ctx) {
+  ctx->generation++;
   ctx->numRules = 0;
   ctx->fwFeatures = 0;
   FWScanIndexFree(&ctx->scanIndex);

@@ -72,6 +72,8 @@ ZelStatus FWCreateFilter(SLCGenericFilter* filter) {
   ctx->fwFeatures = 0;
   ctx->numRules = 0;
   ctx->ioctl = 0;
+  ctx->scanIndex = nullptr;
+  ctx->generation = 0;
   ctx->defaultAction = DefaultActionFromConfig(filter);
 
   ZelStatus status = zel_SpinlockCreate(slcGenericModuleID, slcGenericHeapID, "slcg.fw.config",

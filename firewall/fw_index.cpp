@@ -1,7 +1,8 @@
 // Building and maintaining the scan index of the general rules (layout and
 // meaning in fw_index.h). Runs with configLock held exclusively, by the
-// filter's sole owner while it is destroyed, or on rules no packet sees
-// yet (a replacing ruleset staged before the hold).
+// filter's sole owner while it is destroyed, on rules no packet sees yet (a
+// replacing ruleset staged before the hold), or, for a build only, with
+// configLock held shared (an addition staged beside the rules in force).
 
 #include "firewall/fw_index.h"
 
@@ -176,10 +177,15 @@ void SlotFromRule(const FWRule& r, FWScanSlot* slot) {
 
 }  // namespace
 
-ZelStatus FWScanIndexBuild(const ListLinks* ruleList, FWScanIndex** index) {
+ZelStatus FWScanIndexBuild(const ListLinks* ruleList, FWScanIndex** index,
+                           const ListLinks* added) {
   *index = nullptr;
+  const ListLinks* const lists[2] = {ruleList, added};
   uint64_t count = 0;
-  for (const ListLinks* l = ruleList->prev; l != ruleList; l = l->prev) count++;
+  for (const ListLinks* list : lists) {
+    if (list == nullptr) continue;
+    for (const ListLinks* l = list->prev; l != list; l = l->prev) count++;
+  }
   if (count == 0) return ZEL_OK;
 
   const uint64_t bytes = kFixedBytes + count * kBytesPerRule;
@@ -194,10 +200,13 @@ ZelStatus FWScanIndexBuild(const ListLinks* ruleList, FWScanIndex** index) {
   idx->capacity = static_cast<uint32_t>(count);
 
   uint32_t i = 0;
-  for (ListLinks* l = ruleList->prev; l != ruleList; l = l->prev, i++) {
-    FWRuleEntry* entry = FWEntryFromLink(l);
-    SlotFromRule(entry->rule, &idx->slots[i]);
-    idx->entries[i] = entry;
+  for (const ListLinks* list : lists) {
+    if (list == nullptr) continue;
+    for (ListLinks* l = list->prev; l != list; l = l->prev, i++) {
+      FWRuleEntry* entry = FWEntryFromLink(l);
+      SlotFromRule(entry->rule, &idx->slots[i]);
+      idx->entries[i] = entry;
+    }
   }
   idx->count = i;
   idx->classifier = nullptr;

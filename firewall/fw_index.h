@@ -81,9 +81,14 @@ inline uint64_t FWFold32(uint64_t rawHi, uint64_t rawLo) {
 }
 
 // Builds the index of `ruleList` (entries linked at the front, so walked
-// from the back), with its classifier. An empty list yields null and
-// ZEL_OK. ZEL_NO_MEMORY when an allocation fails; nothing is then allocated.
-[[nodiscard]] ZelStatus FWScanIndexBuild(const ListLinks* ruleList, FWScanIndex** index);
+// from the back), with its classifier; the entries of `added`, when given,
+// follow in ruleset order (the general rules of an addition, before they
+// are linked in front of ruleList). Reads only the entries' match fields,
+// so the shared hold suffices for lists in force. An empty list yields null
+// and ZEL_OK. ZEL_NO_MEMORY when an allocation fails; nothing is then
+// allocated.
+[[nodiscard]] ZelStatus FWScanIndexBuild(const ListLinks* ruleList, FWScanIndex** index,
+                                         const ListLinks* added = nullptr);
 void FWScanIndexFree(FWScanIndex** index);
 // Drops the slot of `entry`, if any, keeping the others in order; allocates
 // nothing. Called before the entry is unlinked and freed. With a

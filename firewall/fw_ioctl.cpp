@@ -13,11 +13,10 @@
 //    than numRules records: refused with a failure status reply before any
 //    rule is read or changed (all or nothing).
 //
-// Locks: a clear and an adding push hold the filter's configLock
-// exclusively; a replacing push builds its rules first and holds it
+// Locks: a clear holds the filter's configLock exclusively; a push builds
+// its rules first (an adding one with configLock held shared) and holds it
 // exclusively only to swap them in; the state query holds it shared while
-// it copies; every reply is sent after the
-// lock is released.
+// it copies; every reply is sent after the lock is released.
 #include "firewall/fw_ioctl.h"
 #include "firewall/fw_index.h"
 
@@ -196,6 +195,7 @@ uint32_t ClearSingleRules(SLCGenericFilter* filter, FWFilterContext* ctx, const 
       FWScanIndexForget(ctx->scanIndex, entry);
       List_Remove(&entry->link);
       FWRuleEntryFree(entry);
+      ctx->generation++;
     } else if (method == FWClearMethodStats) {
       entry->rule.pktCount = 0;
       entry->rule.byteCount = 0;
@@ -290,11 +290,11 @@ ZelStatus FWValidateRulesetSize(uint32_t version, uint32_t numRules, uint64_t le
 }
 
 ZelStatus FWSetIoctlRuleset(SLCGenericFilter* filter, FWRuleset* ruleset, uint32_t replace) {
-  // A replacement is built before the exclusive hold, so the packet path
-  // keeps flowing meanwhile; adding needs the rules in force throughout.
+  // Both are built before the exclusive hold, so the packet path keeps
+  // flowing meanwhile: a replacement with no lock, an addition, which reads
+  // the rules in force, with configLock held shared.
   if (replace != 0) return FWReplaceRuleset(filter, ruleset, 1);
-  SLCGenericWriteGuard hold(FWContext(filter)->configLock);
-  return FWApplyRuleset(filter, ruleset, 0, 1);
+  return FWAddRuleset(filter, ruleset, 1);
 }
 
 void FWFilterIoctlRequest(SLCGenericFilter* filter, uint32_t requestCode, void* payload,

@@ -78,13 +78,19 @@ class UndoTest : public FirewallTest {
   // Fails allocation n = 1, 2, ... of the application until it succeeds;
   // returns the number of allocations it needed. `messages` collects the
   // failure messages seen.
-  uint64_t FailEveryAllocation(bool replace, std::set<std::string>* messages) {
+  // `staged`: an addition through FWAddRuleset, built under the shared
+  // hold beside the rules in force.
+  uint64_t FailEveryAllocation(bool replace, std::set<std::string>* messages,
+                               bool staged = false) {
     const auto rs = rules::ParseRuleset(kNext);
     const Fingerprint before = Capture();
     for (uint64_t n = 1;; n++) {
       host::Log::Clear();
       host::Faults::Fail("zel_HeapAllocWithRA", ZEL_NO_MEMORY, n);
-      const ZelStatus status = Apply(rs, replace);
+      std::vector<uint8_t> copy(rs);
+      const ZelStatus status =
+          staged ? FWAddRuleset(filter_, reinterpret_cast<FWRuleset*>(copy.data()), 1)
+                 : Apply(rs, replace);
       const bool injected = host::Faults::Injected("zel_HeapAllocWithRA") > 0;
       host::Faults::ClearAll();
       if (!injected) {
@@ -155,14 +161,18 @@ TEST_F(UndoTest, ReplaceFailingAtAnyAllocationChangesNothing) {
   EXPECT_EQ(host::ResPools::Outstanding(0xffff), 1);
 }
 
-TEST_F(UndoTest, AddFailingAtAnyAllocationChangesNothing) {
+class AddUndoTest : public UndoTest, public ::testing::WithParamInterface<bool> {};
+
+TEST_P(AddUndoTest, FailingAtAnyAllocationChangesNothing) {
+  const bool staged = GetParam();
   FwModel model = ModelOfBefore();
   const uint32_t exactBefore = static_cast<uint32_t>(ExactEntries().size());
   std::set<std::string> messages;
-  const uint64_t allocations = FailEveryAllocation(/*replace=*/false, &messages);
-  // Table and buckets, a copy of every former exact entry, the new entries
-  // (the first record merges into its copy), the scan index.
-  EXPECT_EQ(allocations, 2u + exactBefore + 6u + 3u + 1u);
+  const uint64_t allocations = FailEveryAllocation(/*replace=*/false, &messages, staged);
+  // Table and buckets, a copy of every former exact entry (staged: and the
+  // block pairing each copy with its original), the new entries (the first
+  // record merges into its copy), the scan index.
+  EXPECT_EQ(allocations, 2u + (staged ? 1u : 0u) + exactBefore + 6u + 3u + 1u);
   EXPECT_EQ(messages, (std::set<std::string>{
                           "Failed to allocate firewall ruleset hash", "Failed to copy hash entries",
                           "Failed to allocate rule list entry", "Failed to insert hash entry",
@@ -179,6 +189,8 @@ TEST_F(UndoTest, AddFailingAtAnyAllocationChangesNothing) {
     }
   }
 }
+INSTANTIATE_TEST_SUITE_P(Roads, AddUndoTest, ::testing::Values(false, true),
+                         [](const auto& info) { return info.param ? "Staged" : "InPlace"; });
 
 // Adding to a filter that never had a table (nothing to copy).
 TEST_F(FirewallTest, AddToAFilterWithoutRulesUndoesToNoTable) {
