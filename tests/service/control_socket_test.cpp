@@ -1,9 +1,7 @@
 // The control protocol's framing and bounds, and a running sluice-host
 // facing hostile clients: every malformed request gets an error reply, the
 // host keeps serving and the module heap is what it was.
-#include <fcntl.h>
 #include <gtest/gtest.h>
-#include <signal.h>
 #include <sys/socket.h>
 #include <sys/stat.h>
 #include <sys/wait.h>
@@ -14,7 +12,6 @@
 #include <fstream>
 #include <random>
 #include <string>
-#include <thread>
 
 #include "service/protocol/protocol.h"
 #include "tests/service/host_process.h"
@@ -255,56 +252,26 @@ TEST_F(ServiceHostTest, PeersOfAnotherUserAreRefused) {
 // Settings from a file: the host takes its socket and agents from it, and
 // refuses a file with an unknown setting before loading anything.
 TEST(ServiceHostConfig, ReadsSettingsFromAFileAndRefusesUnknownOnes) {
-  char tmpl[] = "/tmp/sluice-cfg-test.XXXXXX";
-  ASSERT_NE(mkdtemp(tmpl), nullptr);
-  const std::string dir = tmpl, sock = dir + "/c.sock", good = dir + "/good.conf",
-                    bad = dir + "/bad.conf";
-  std::ofstream(good) << "# a host from a file\n"
-                      << "socket " << sock << "\n"
-                      << "agent cfg:default-action=ACTION_DROP   # trailing comment\n"
-                      << "gre memory\n";
-  std::ofstream(bad) << "agent x\nbogus 1\n";
-  auto spawn = [](const std::string& config) {
-    pid_t pid = fork();
-    if (pid == 0) {
-      int devnull = open("/dev/null", O_WRONLY);
-      dup2(devnull, 2);
-      execl(SLUICE_HOST_BIN, "sluice-host", "--config", config.c_str(), "--max-seconds", "30",
-            static_cast<char*>(nullptr));
-      _exit(127);
-    }
-    return pid;
-  };
-  auto exitStatus = [](pid_t pid) {
-    int status = 0;
-    waitpid(pid, &status, 0);
-    return WIFEXITED(status) ? WEXITSTATUS(status) : 128 + WTERMSIG(status);
-  };
+  HostProcess bad, good;
+  ASSERT_TRUE(bad.MakeDir() && good.MakeDir());
+  std::ofstream(bad.dir + "/c.conf") << "agent x\nbogus 1\n";
+  ASSERT_TRUE(bad.Spawn({"--config", bad.dir + "/c.conf"}));
+  EXPECT_EQ(bad.Wait(), 2);
 
-  EXPECT_EQ(exitStatus(spawn(bad)), 2);
-
-  pid_t pid = spawn(good);
-  ASSERT_GT(pid, 0);
-  Message status;
-  bool up = false;
-  for (int i = 0; i < 100 && !up; i++) {
-    Message req;
-    req.type = Type::kStatus;
-    req.args["agent"] = "cfg";
-    std::string error;
-    up = slcproto::Call(sock, req, &status, &error, 5000);
-    if (!up) std::this_thread::sleep_for(std::chrono::milliseconds(50));
-  }
-  EXPECT_TRUE(up);
-  if (up) {
-    ASSERT_EQ(status.args["agents"].size(), 1u);
-    EXPECT_EQ(status.args["agents"][0]["name"], "cfg");
-  }
-  kill(pid, SIGTERM);
-  EXPECT_EQ(exitStatus(pid), 0);
-  unlink(good.c_str());
-  unlink(bad.c_str());
-  rmdir(dir.c_str());
+  std::ofstream(good.dir + "/c.conf") << "# a host from a file\n"
+                                      << "socket " << good.sock << "\n"
+                                      << "agent cfg:default-action=ACTION_DROP   # comment\n"
+                                      << "gre memory\n";
+  ASSERT_TRUE(good.Spawn({"--config", good.dir + "/c.conf"}));
+  ASSERT_TRUE(good.Answers());
+  Message req, status;
+  req.type = Type::kStatus;
+  req.args["agent"] = "cfg";
+  std::string error;
+  ASSERT_TRUE(slcproto::Call(good.sock, req, &status, &error, 5000)) << error;
+  ASSERT_EQ(status.args["agents"].size(), 1u);
+  EXPECT_EQ(status.args["agents"][0]["name"], "cfg");
+  EXPECT_EQ(good.Stop(), 0);
 }
 
 }  // namespace
