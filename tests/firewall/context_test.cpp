@@ -1,5 +1,6 @@
-// The firewall context: the default action from the agent's configuration,
-// the attachment-state copy, and the no-ruleset packet path.
+// The firewall context: the default action from the agent's configuration
+// and the no-ruleset packet path. The attachment-state copy is asserted by
+// every packet-path test that attaches a slow path (packet_fixture.h).
 
 #include <cstring>
 
@@ -7,7 +8,6 @@
 
 namespace {
 
-using testsupport::kDefaultAgent;
 using testsupport::ModuleTest;
 
 // The keyword must be exact and in first place; once per filter, a bad one
@@ -38,18 +38,6 @@ TEST_F(ModuleTest, DefaultActionComesFromTheAgentConfiguration) {
       EXPECT_EQ(host::Log::Count(rows[i].complaint, 2), 2u);
     }
   }
-}
-
-TEST_F(ModuleTest, AttachStateIsCopiedUnderTheConfigLock) {
-  host::FilterId id = CreateFilter();
-  host::Sluice::SetPolicy(host::RequestKind::SetSlowPath, testsupport::Replies(host::ReplyMode::Deferred));
-  ASSERT_EQ(host::Sluice::RegisterSlowPath(kDefaultAgent, 4), ZEL_OK);
-  EXPECT_EQ(Ctx(id)->spAttachState, SLCGenericSpDetached);
-  host::Timers::RunDue();
-  EXPECT_EQ(Ctx(id)->spAttachState, SLCGenericSpAttaching);
-  host::Sluice::ReleaseReplies(host::RequestKind::SetSlowPath);
-  EXPECT_EQ(Ctx(id)->spAttachState, SLCGenericSpAttached);
-  EXPECT_EQ(Filter(id)->spAttachState, SLCGenericSpAttached);
 }
 
 // Without a ruleset the default action takes the whole list: punt needs a

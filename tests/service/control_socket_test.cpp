@@ -32,22 +32,6 @@ Bytes Header(uint32_t magic, uint16_t version, uint16_t type, uint32_t argsLen, 
   return b;
 }
 
-TEST(ServiceProtocol, RoundTripsArgumentsAndBlob) {
-  Message m;
-  m.type = Type::kRulesetWrite;
-  m.args["filter"] = "vm1.eth0";
-  m.blob = {0, 1, 2, 0xff};
-  Bytes wire = slcproto::Encode(m);
-  slcproto::Header h;
-  std::string error;
-  ASSERT_TRUE(slcproto::ParseHeader(wire, &h, &error)) << error;
-  Message back;
-  ASSERT_TRUE(slcproto::ParseBody(h, std::span(wire).subspan(16), &back, &error)) << error;
-  EXPECT_EQ(back.type, Type::kRulesetWrite);
-  EXPECT_EQ(back.args["filter"], "vm1.eth0");
-  EXPECT_EQ(back.blob, m.blob);
-}
-
 TEST(ServiceProtocol, RefusesHeadersOutsideTheBounds) {
   struct Case {
     const char* what;
