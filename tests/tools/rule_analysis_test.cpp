@@ -8,7 +8,7 @@
 
 #include "host/sluice/framework.h"
 #include "tests/support/module_fixture.h"
-#include "tools/lib/frames.h"
+#include "tests/support/tool_frames.h"
 #include "tools/lib/verdict_diff.h"
 
 namespace {
@@ -151,22 +151,20 @@ TEST(Diff, PairsRulesByWhatTheyMatch) {
 }
 
 TEST(Diff, CaptureVerdictsComeFromTheModule) {
-  using frames::FrameBuilder;
+  using namespace toolframes;
   using frames::Ip4;
-  using frames::Mac;
-  const auto vm = Mac("02:00:00:00:00:10"), gw = Mac("02:00:00:00:00:01");
   auto tcp = [&](uint16_t dport, uint8_t last = 1) {
     frames::Ip4Addr src = Ip4("10.0.0.1");
     src[3] = last;
-    return FrameBuilder().Eth(vm, gw).Ipv4(src, Ip4("10.0.0.10")).Tcp(40000, dport).Build();
+    return FrameBuilder().Eth(kVm, kGw).Ipv4(src, Ip4("10.0.0.10")).Tcp(40000, dport).Build();
   };
   const std::vector<frames::CaptureRecord> capture = {
       {1, tcp(22), 0},                 // 1: general drop -> general accept
       {1, tcp(80), 0},                 // 2: exact accept on both sides
       {1, tcp(80, 7), 0},              // 3: no rule -> default drop
       {2, tcp(23), 0},                 // 4: same drop both sides
-      {1, FrameBuilder().Eth(gw, vm).Arp(1, vm, Ip4("10.0.0.10"), Mac("00:00:00:00:00:00"),
-                                         Ip4("10.0.0.1")).Build(), 0},  // 5: ARP: default drop
+      {1, FrameBuilder().Eth(kGw, kVm).Arp(1, kVm, Ip4("10.0.0.10"), {}, Ip4("10.0.0.1")).Build(),
+       0},  // 5: ARP: default drop
   };
   const std::string exact =
       "action=accept dmac=02:00:00:00:00:10 smac=02:00:00:00:00:01 vlan=none ipv4 sa=10.0.0.1 "
