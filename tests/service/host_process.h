@@ -64,6 +64,24 @@ struct HostProcess {
     return MakeDir() &&
            Spawn({"--socket", sock, "--gre", "memory", "--agent", agent}) && Answers();
   }
+  // One request on a new connection: the reply, or a message whose only
+  // argument is the error when none came.
+  slcproto::Message Call(slcproto::Type type, nlohmann::json args = nlohmann::json::object(),
+                         std::vector<uint8_t> blob = {}) {
+    slcproto::Message m, reply;
+    m.type = type;
+    m.args = std::move(args);
+    m.blob = std::move(blob);
+    std::string error;
+    if (!slcproto::Call(sock, m, &reply, &error, 5000)) {
+      reply = {};
+      reply.args["error"] = error;
+    }
+    return reply;
+  }
+  uint64_t HeapBytes() {
+    return Call(slcproto::Type::kStats).args.value("heapBytes", UINT64_MAX);
+  }
   // Waits for the host to exit and returns its exit status (128 + signal).
   int Wait() {
     int status = 0;

@@ -74,12 +74,7 @@ class SlowPathLinkTest : public ::testing::Test {
   }
   int Stop() { return host_.Stop(); }
   Message Call(Type type, nlohmann::json args = nlohmann::json::object()) {
-    Message m, reply;
-    m.type = type;
-    m.args = std::move(args);
-    std::string error;
-    if (!slcproto::Call(host_.sock, m, &reply, &error, 5000)) reply.args["error"] = error;
-    return reply;
+    return host_.Call(type, std::move(args));
   }
   // Opens a link and sends its registration; returns the fd and the answer.
   int Register(nlohmann::json args, Message* answer) {
@@ -115,14 +110,13 @@ class SlowPathLinkTest : public ::testing::Test {
     }
     return now;
   }
-  uint64_t Heap() { return Call(Type::kStats).args.value("heapBytes", UINT64_MAX); }
 
   HostProcess host_;
   std::vector<int> links_;
 };
 
 TEST_F(SlowPathLinkTest, RegistrationNamesARegisteredAgent) {
-  const uint64_t heap = Heap();
+  const uint64_t heap = host_.HeapBytes();
   const nlohmann::json refused[] = {
       nlohmann::json::object(),
       {{"agent", "no-such-agent"}},
@@ -142,18 +136,18 @@ TEST_F(SlowPathLinkTest, RegistrationNamesARegisteredAgent) {
   ASSERT_TRUE(b.args.value("ok", false)) << b.args.dump();
   EXPECT_NE(a.args["id"], b.args["id"]) << "each slow path has its own number";
   EXPECT_EQ(SlowPaths(2), 2u);
-  EXPECT_GT(Heap(), heap) << "the module keeps a record per slow path";
+  EXPECT_GT(host_.HeapBytes(), heap) << "the module keeps a record per slow path";
 
   // Closing the links unregisters both slow paths and frees their records.
   for (int fd : links_) close(fd);
   links_.clear();
   EXPECT_EQ(SlowPaths(0), 0u);
-  EXPECT_EQ(Heap(), heap);
+  EXPECT_EQ(host_.HeapBytes(), heap);
   EXPECT_EQ(Stop(), 0);
 }
 
 TEST_F(SlowPathLinkTest, RequestsAboutFiltersNotAttachedAreRefused) {
-  const uint64_t heap = Heap();
+  const uint64_t heap = host_.HeapBytes();
   Message answer;
   const int fd = Register({{"agent", "fw"}}, &answer);
   ASSERT_TRUE(answer.args.value("ok", false)) << answer.args.dump();
@@ -192,7 +186,7 @@ TEST_F(SlowPathLinkTest, RequestsAboutFiltersNotAttachedAreRefused) {
   ASSERT_EQ(write(fd, garbage.data(), garbage.size()), 64);
   EXPECT_EQ(SlowPaths(0), 0u);
   EXPECT_TRUE(Call(Type::kHello).args.value("ok", false));
-  EXPECT_EQ(Heap(), heap);
+  EXPECT_EQ(host_.HeapBytes(), heap);
   EXPECT_EQ(Stop(), 0);
 }
 
