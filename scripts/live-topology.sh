@@ -14,6 +14,22 @@
 #                 for tests: exits 77 (skipped) with the reason unless
 #                 running as root with every TOOL installed.
 #
+# Helpers for the tests that drive traffic through it:
+#   topo_check NAME COMMAND...       runs COMMAND, prints ok/FAIL NAME and
+#                                    sets FAILED=1 when it fails
+#   topo_wait_for FILE PATTERN [N]   waits up to 5 s for N (default 1)
+#                                    lines matching PATTERN in FILE
+#   topo_json EXPR                   prints the Python expression EXPR of
+#                                    the JSON document d on standard input
+#   topo_send_udp NS ADDR PORT COUNT [BYTES] [GAP]
+#                                    sends COUNT one-line datagrams of BYTES
+#                                    (default 16) from namespace NS, GAP
+#                                    seconds apart (default 0.002)
+#   topo_recv_udp NS PORT SECONDS FILE
+#                                    receives datagrams on PORT in NS into
+#                                    FILE, one a line, in the background;
+#                                    LAST_RECV is the receiver's pid
+#
 # Senders have checksum and segmentation offload turned off so every frame
 # read from an interface is complete.
 
@@ -67,4 +83,40 @@ topo_up() {
     ip netns exec "$p-net" ethtool -K eth0 tx off tso off gso off >/dev/null 2>&1
   fi
   return 0
+}
+
+topo_check() {
+  local name=$1
+  shift
+  if "$@"; then echo "ok   $name"; else echo "FAIL $name"; FAILED=1; fi
+}
+
+topo_wait_for() {
+  local i
+  for i in $(seq 50); do
+    [ "$(grep -c -- "$2" "$1" 2>/dev/null)" -ge "${3:-1}" ] && return 0
+    sleep 0.1
+  done
+  return 1
+}
+
+topo_json() {
+  python3 -c 'import json, sys; d = json.load(sys.stdin); print(eval(sys.argv[1]))' "$1"
+}
+
+topo_send_udp() {
+  ip netns exec "$1" python3 -c '
+import socket, sys, time
+s = socket.socket(socket.AF_INET, socket.SOCK_DGRAM)
+line = b"x" * int(sys.argv[4]) + b"\n"
+for i in range(int(sys.argv[3])):
+    s.sendto(line, (sys.argv[1], int(sys.argv[2])))
+    time.sleep(float(sys.argv[5]))' "$2" "$3" "$4" "${5:-16}" "${6:-0.002}"
+}
+
+# Started through ip directly (not a subshell) so that $! is the receiver
+# and killing it ends it.
+topo_recv_udp() {
+  ip netns exec "$1" timeout "$3" socat -u "UDP-RECV:$2" - >"$4" 2>/dev/null &
+  LAST_RECV=$!
 }

@@ -48,13 +48,9 @@ TEST_F(AgentProperty, EmptyPiecesCreateNothing) {
   EXPECT_EQ(CreateAgents("x  y"), ZEL_OK);
   EXPECT_EQ(host::Log::Count("Registering new fastpath ''"), 2u);
   EXPECT_EQ(CreateAgents(""), ZEL_OK);
+  EXPECT_EQ(CreateAgents("tab\tbed"), ZEL_OK);  // only spaces separate
   EXPECT_EQ(AgentNames(), (std::vector<std::string>{"sluice-generic-quelmar", "solo", "lead", "x",
-                                                    "y"}));
-}
-
-TEST_F(AgentProperty, OnlySpacesSeparate) {
-  EXPECT_EQ(CreateAgents("tab\tbed"), ZEL_OK);
-  EXPECT_EQ(AgentNames().back(), "tab\tbed");
+                                                    "y", "tab\tbed"}));
 }
 
 TEST_F(AgentProperty, ConfigurationFollowsTheFirstColon) {
@@ -92,45 +88,34 @@ TEST_F(AgentProperty, BufferRefused) {
   EXPECT_EQ(AgentNames().size(), 1u);
 }
 
-struct CreationFailure {
-  const char* call;
-  ZelStatus expected;
-  const char* message;
-};
-
-class AgentCreationFailure : public ModuleTest,
-                             public ::testing::WithParamInterface<CreationFailure> {};
-
-TEST_P(AgentCreationFailure, UndoesWhatItDid) {
-  const CreationFailure& f = GetParam();
-  host::Faults::Fail(f.call, ZEL_FAILURE);
-  char text[] = "failing";
-  EXPECT_EQ(SLCGenericInitFastPathAgent(text), f.expected);
-  EXPECT_EQ(AgentNames(), std::vector<std::string>{"sluice-generic-quelmar"});
-  EXPECT_FALSE(host::Sluice::AgentRegistered("failing"));
-  EXPECT_FALSE(host::CharDevs::Registered("failing"));
-  EXPECT_TRUE(host::Log::Contains(f.message, 2)) << f.message;
-}
-
-INSTANTIATE_TEST_SUITE_P(
-    EachStep, AgentCreationFailure,
-    ::testing::Values(
-        CreationFailure{"zel_HeapAllocWithRA", ZEL_NO_MEMORY,
-                        "Failed to allocate memory for fast path agent"},
-        CreationFailure{"zel_SpinlockCreate", ZEL_FAILURE,
-                        "Failed to create lock (0xbad0001): Failure"},
-        CreationFailure{"zel_SluiceRegisterFastPath", ZEL_FAILURE,
-                        "Failed to register agent (0xbad0001): Failure"},
-        CreationFailure{"zel_CharDevRegister", ZEL_FAILURE,
-                        "Failed to register agent (0xbad0001): Failure"}));
-
-TEST_F(ModuleTest, PropertyFailureKeepsTheAgent) {
-  host::Faults::Fail("zel_SluicePropertyRegister", ZEL_FAILURE);
-  char text[] = "noprop";
-  EXPECT_EQ(SLCGenericInitFastPathAgent(text), ZEL_OK);
-  EXPECT_EQ(AgentNames().back(), "noprop");
-  EXPECT_EQ(Agent("noprop")->rulesetProp, nullptr);
-  EXPECT_FALSE(host::Sluice::PropertyRegistered("noprop.ruleset"));
+// Each step failing in turn: the agent is undone with the step's status and
+// message, except the ruleset property, without which the agent lives on.
+TEST_F(ModuleTest, CreationFailingAtEachStep) {
+  const struct { const char* call; ZelStatus status; const char* message; } rows[] = {
+      {"zel_HeapAllocWithRA", ZEL_NO_MEMORY, "Failed to allocate memory for fast path agent"},
+      {"zel_SpinlockCreate", ZEL_FAILURE, "Failed to create lock (0xbad0001): Failure"},
+      {"zel_SluiceRegisterFastPath", ZEL_FAILURE, "Failed to register agent (0xbad0001): Failure"},
+      {"zel_CharDevRegister", ZEL_FAILURE, "Failed to register agent (0xbad0001): Failure"},
+      {"zel_SluicePropertyRegister", ZEL_OK, nullptr},
+  };
+  for (const auto& r : rows) {
+    SCOPED_TRACE(r.call);
+    host::Log::Clear();
+    host::Faults::Fail(r.call, ZEL_FAILURE);
+    char text[] = "failing";
+    EXPECT_EQ(SLCGenericInitFastPathAgent(text), r.status);
+    if (r.message != nullptr) {
+      EXPECT_EQ(AgentNames(), std::vector<std::string>{"sluice-generic-quelmar"});
+      EXPECT_FALSE(host::Sluice::AgentRegistered("failing"));
+      EXPECT_FALSE(host::CharDevs::Registered("failing"));
+      EXPECT_TRUE(host::Log::Contains(r.message, 2));
+    } else {
+      EXPECT_EQ(AgentNames().back(), "failing");
+      EXPECT_EQ(Agent("failing")->rulesetProp, nullptr);
+      EXPECT_FALSE(host::Sluice::PropertyRegistered("failing.ruleset"));
+    }
+    host::Faults::ClearAll();
+  }
 }
 
 TEST_F(ModuleTest, EmptyNameCreatesNothingSilently) {

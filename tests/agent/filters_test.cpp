@@ -45,40 +45,34 @@ TEST_F(Filters, ReadsItsConfiguration) {
   }
 }
 
-struct ConfigFailure {
-  const char* call;
-  const char* message;
-  bool namesFilter;
-};
-
-class ConfigReadFailure : public ModuleTest, public ::testing::WithParamInterface<ConfigFailure> {};
-
-TEST_P(ConfigReadFailure, CancelsTheFilter) {
-  const ConfigFailure& f = GetParam();
-  host::Faults::Fail(f.call, ZEL_FAILURE);
-  host::FilterId id = 0;
-  EXPECT_EQ(host::Sluice::CreateFilter(kDefaultAgent, {}, &id), ZEL_FAILURE);
-  EXPECT_TRUE(List_IsEmpty(&Agent()->filters));
-  std::vector<host::LogRecord> records = host::Log::Records();
-  auto it = std::find_if(records.begin(), records.end(),
-                         [&](const host::LogRecord& r) { return r.text == f.message; });
-  ASSERT_NE(it, records.end()) << f.message;
-  EXPECT_EQ(it->urgency, 2);
-  EXPECT_EQ(it->object, f.namesFilter ? "vnic0" : "");
+// Each configuration query failing cancels the filter with its message,
+// which names the filter once its name is known.
+TEST_F(Filters, ConfigReadFailureCancelsTheFilter) {
+  const struct { const char* call; const char* message; bool namesFilter; } rows[] = {
+      {"zel_SluiceGetName", "Could not get filter name (0xbad0001): Failure", false},
+      {"zel_SluiceGetFailurePolicy", "Could not get filter failure policy (0xbad0001): Failure",
+       true},
+      {"zel_SluiceGetEndPointType", "Could not get filter endpoint type (0xbad0001): Failure",
+       true},
+      {"zel_SluiceGetVMUUID", "Could not get filter vm uuid (0xbad0001): Failure", true},
+      {"zel_SluiceGetVnicIndex", "Could not get filter vnic index (0xbad0001): Failure", true},
+  };
+  for (const auto& r : rows) {
+    SCOPED_TRACE(r.call);
+    host::Log::Clear();
+    host::Faults::Fail(r.call, ZEL_FAILURE);
+    host::FilterId id = 0;
+    EXPECT_EQ(host::Sluice::CreateFilter(kDefaultAgent, {}, &id), ZEL_FAILURE);
+    EXPECT_TRUE(List_IsEmpty(&Agent()->filters));
+    const std::vector<host::LogRecord> records = host::Log::Records();
+    auto it = std::find_if(records.begin(), records.end(),
+                           [&](const host::LogRecord& l) { return l.text == r.message; });
+    ASSERT_NE(it, records.end());
+    EXPECT_EQ(it->urgency, 2);
+    EXPECT_EQ(it->object, r.namesFilter ? "vnic0" : "");
+    host::Faults::ClearAll();
+  }
 }
-
-INSTANTIATE_TEST_SUITE_P(
-    EachQuery, ConfigReadFailure,
-    ::testing::Values(
-        ConfigFailure{"zel_SluiceGetName", "Could not get filter name (0xbad0001): Failure", false},
-        ConfigFailure{"zel_SluiceGetFailurePolicy",
-                      "Could not get filter failure policy (0xbad0001): Failure", true},
-        ConfigFailure{"zel_SluiceGetEndPointType",
-                      "Could not get filter endpoint type (0xbad0001): Failure", true},
-        ConfigFailure{"zel_SluiceGetVMUUID", "Could not get filter vm uuid (0xbad0001): Failure",
-                      true},
-        ConfigFailure{"zel_SluiceGetVnicIndex",
-                      "Could not get filter vnic index (0xbad0001): Failure", true}));
 
 TEST_F(Filters, CreationFailuresFreeEverything) {
   host::FilterId id = 0;

@@ -19,6 +19,11 @@ class SlowPaths : public ModuleTest {
     }
     return nullptr;
   }
+  // Registers the slow paths, then runs the attach pass.
+  static void Register(std::initializer_list<uint32_t> ids) {
+    for (uint32_t id : ids) ASSERT_EQ(host::Sluice::RegisterSlowPath(kDefaultAgent, id), ZEL_OK);
+    host::Timers::RunDue();
+  }
   std::vector<host::FilterId> MakeFilters(int n) {
     std::vector<host::FilterId> ids;
     for (int i = 0; i < n; i++) ids.push_back(CreateFilter(kDefaultAgent, "f" + std::to_string(i)));
@@ -27,9 +32,7 @@ class SlowPaths : public ModuleTest {
 };
 
 TEST_F(SlowPaths, FiltersSpreadToTheLeastLoadedTiesToTheOldest) {
-  ASSERT_EQ(host::Sluice::RegisterSlowPath(kDefaultAgent, 1), ZEL_OK);
-  ASSERT_EQ(host::Sluice::RegisterSlowPath(kDefaultAgent, 2), ZEL_OK);
-  host::Timers::RunDue();
+  Register({1, 2});
 
   std::vector<host::FilterId> ids = MakeFilters(5);
   std::vector<uint32_t> chosen;
@@ -78,8 +81,7 @@ TEST_F(SlowPaths, TimerRefusedWaitsForTheNextRegistration) {
   host::Timers::RunDue();
   EXPECT_EQ(Filter(id)->spAttachState, SLCGenericSpDetached);
 
-  ASSERT_EQ(host::Sluice::RegisterSlowPath(kDefaultAgent, 2), ZEL_OK);
-  host::Timers::RunDue();
+  Register({2});
   EXPECT_EQ(Filter(id)->spAttachState, SLCGenericSpAttached);
   EXPECT_EQ(host::Sluice::SlowPathOf(id), 1u);
 }
@@ -88,8 +90,7 @@ TEST_F(SlowPaths, FailedRepliesAreRetriedCountingUp) {
   host::FilterId id = CreateFilter();
   host::Sluice::SetPolicy(host::RequestKind::SetSlowPath,
                           Replies(host::ReplyMode::Deferred, ZEL_FAILURE));
-  ASSERT_EQ(host::Sluice::RegisterSlowPath(kDefaultAgent, 3), ZEL_OK);
-  host::Timers::RunDue();
+  Register({3});
   for (int i = 0; i < 3; i++) {
     ASSERT_EQ(host::Sluice::ReleaseReplies(host::RequestKind::SetSlowPath), 1u);
     EXPECT_EQ(Filter(id)->spAttachState, SLCGenericSpAttaching);
@@ -110,8 +111,7 @@ TEST_F(SlowPaths, FailedRepliesAreRetriedCountingUp) {
 
 TEST_F(SlowPaths, RefusedRequestLeavesTheFilterDetached) {
   host::Sluice::SetPolicy(host::RequestKind::SetSlowPath, Refuses(ZEL_WOULD_BLOCK));
-  ASSERT_EQ(host::Sluice::RegisterSlowPath(kDefaultAgent, 1), ZEL_OK);
-  host::Timers::RunDue();
+  Register({1});
   host::FilterId id = CreateFilter();
   EXPECT_EQ(Filter(id)->spAttachState, SLCGenericSpDetached);
   EXPECT_EQ(Filter(id)->slowPath, nullptr);
@@ -124,9 +124,7 @@ TEST_F(SlowPaths, RefusedRequestLeavesTheFilterDetached) {
 }
 
 TEST_F(SlowPaths, UnregistrationMovesFiltersAndLastOneLeavesThemDetached) {
-  ASSERT_EQ(host::Sluice::RegisterSlowPath(kDefaultAgent, 1), ZEL_OK);
-  ASSERT_EQ(host::Sluice::RegisterSlowPath(kDefaultAgent, 2), ZEL_OK);
-  host::Timers::RunDue();
+  Register({1, 2});
   std::vector<host::FilterId> ids = MakeFilters(3);
 
   ASSERT_EQ(host::Sluice::UnregisterSlowPath(kDefaultAgent, 1), ZEL_OK);
@@ -147,8 +145,7 @@ TEST_F(SlowPaths, UnregistrationMovesFiltersAndLastOneLeavesThemDetached) {
 
 TEST_F(SlowPaths, UnregistrationWhileAttachingIsBusyUntilTheReply) {
   host::Sluice::SetPolicy(host::RequestKind::SetSlowPath, Replies(host::ReplyMode::Deferred));
-  ASSERT_EQ(host::Sluice::RegisterSlowPath(kDefaultAgent, 5), ZEL_OK);
-  host::Timers::RunDue();
+  Register({5});
   host::FilterId id = CreateFilter();
   ASSERT_EQ(Filter(id)->spAttachState, SLCGenericSpAttaching);
 
@@ -163,8 +160,7 @@ TEST_F(SlowPaths, UnregistrationWhileAttachingIsBusyUntilTheReply) {
 }
 
 TEST_F(SlowPaths, TransientClearKeepsTheFilterAttached) {
-  ASSERT_EQ(host::Sluice::RegisterSlowPath(kDefaultAgent, 1), ZEL_OK);
-  host::Timers::RunDue();
+  Register({1});
   host::FilterId id = CreateFilter();
 
   host::Sluice::SetClearAnswers({ZEL_BUSY});
@@ -180,8 +176,7 @@ TEST_F(SlowPaths, TransientClearKeepsTheFilterAttached) {
 }
 
 TEST_F(SlowPaths, DestroyRetriesTransientClearsAndGoesOnAfterOthers) {
-  ASSERT_EQ(host::Sluice::RegisterSlowPath(kDefaultAgent, 1), ZEL_OK);
-  host::Timers::RunDue();
+  Register({1});
   host::FilterId a = CreateFilter(kDefaultAgent, "a");
   host::FilterId b = CreateFilter(kDefaultAgent, "b");
   host::Sluice::SetClearAnswers({ZEL_NO_MEMORY, ZEL_FAILURE});
@@ -196,9 +191,7 @@ TEST_F(SlowPaths, DestroyRetriesTransientClearsAndGoesOnAfterOthers) {
 
 TEST_F(SlowPaths, RepliesFromAnotherThread) {
   host::Sluice::SetPolicy(host::RequestKind::SetSlowPath, Replies(host::ReplyMode::OtherThread));
-  ASSERT_EQ(host::Sluice::RegisterSlowPath(kDefaultAgent, 1), ZEL_OK);
-  ASSERT_EQ(host::Sluice::RegisterSlowPath(kDefaultAgent, 2), ZEL_OK);
-  host::Timers::RunDue();
+  Register({1, 2});
   std::vector<host::FilterId> ids = MakeFilters(6);
   host::Sluice::WaitReplies();
   for (host::FilterId id : ids) {

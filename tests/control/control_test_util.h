@@ -1,6 +1,6 @@
 // Helpers shared by the control-channel and ioctl tests: wire messages of
-// the filter ioctl protocol, little-endian field access, and a fixture with
-// one filter "vnic0" on the default agent.
+// the filter ioctl protocol and character device requests, little-endian
+// field access, and a fixture with one filter "vnic0" on the default agent.
 #pragma once
 
 #include <cstring>
@@ -43,6 +43,20 @@ inline Bytes Msg(uint32_t type, uint32_t word, const Bytes& ruleset = {}) {
 inline Bytes Push(const Bytes& ruleset) { return Msg(FWIoctlMsgRuleset, 1, ruleset); }
 inline Bytes Clear(uint32_t how, const Bytes& rs = {}) { return Msg(FWIoctlMsgClear, how, rs); }
 inline Bytes GetState() { return Bytes{FWIoctlMsgGetState, 0, 0, 0}; }
+
+// A character device request as a tool lays it out, then `tail`. The
+// strings (at most their field's size) are copied raw: one that fills its
+// field has no NUL.
+inline Bytes DevRequest(uint32_t type, const std::string& name, const Bytes& tail = {},
+                        const std::string& uuid = "", uint32_t vnic = 0) {
+  Bytes r(sizeof(FWCharDevRequest) + tail.size(), 0);
+  PutU32(&r, 0, type);
+  PutU32(&r, offsetof(FWCharDevRequest, vNicIndex), vnic);
+  std::copy(name.begin(), name.end(), &r[offsetof(FWCharDevRequest, filterName)]);
+  std::copy(uuid.begin(), uuid.end(), &r[offsetof(FWCharDevRequest, hqUUID)]);
+  std::copy(tail.begin(), tail.end(), r.begin() + sizeof(FWCharDevRequest));
+  return r;
+}
 
 // A wire ruleset from rule texts (a braced list) or a container of FWRules.
 template <typename Rules = std::initializer_list<std::string>>

@@ -1,5 +1,6 @@
-// The firewall context: the default action from the agent's configuration,
-// the attachment-state copy, and the no-ruleset packet path.
+// The firewall context: the default action from the agent's configuration
+// and the no-ruleset packet path. The attachment-state copy is asserted by
+// every packet-path test that attaches a slow path (packet_fixture.h).
 
 #include <cstring>
 
@@ -7,141 +8,83 @@
 
 namespace {
 
-using testsupport::kDefaultAgent;
 using testsupport::ModuleTest;
 
-struct ConfigCase {
-  const char* config;
-  uint32_t action;
-  const char* complaint;   // logged text, or null
-};
-
-class DefaultActionConfig : public ModuleTest, public ::testing::WithParamInterface<ConfigCase> {};
-
-TEST_P(DefaultActionConfig, ChoosesTheAction) {
-  const ConfigCase& c = GetParam();
-  ASSERT_EQ(CreateAgents(std::string("cfg:") + c.config), ZEL_OK);
-  host::Log::Clear();
-  host::FilterId a = CreateFilter("cfg", "one");
-  host::FilterId b = CreateFilter("cfg", "two");
-  EXPECT_EQ(Ctx(a)->defaultAction, c.action);
-  EXPECT_EQ(Ctx(b)->defaultAction, c.action);
-  if (c.complaint != nullptr) {
-    EXPECT_EQ(host::Log::Count(c.complaint, 2), 2u);  // once per filter
-  } else {
-    EXPECT_EQ(host::Log::CountContaining("Invalid default action"), 0u);
+// The keyword must be exact and in first place; once per filter, a bad one
+// is logged and accept used.
+TEST_F(ModuleTest, DefaultActionComesFromTheAgentConfiguration) {
+  const struct { const char* config; uint32_t action; const char* complaint; } rows[] = {
+      {"", SLCGenericActionAccept, nullptr},
+      {"default-action=ACTION_PUNT", SLCGenericActionPunt, nullptr},
+      {"default-action=ACTION_DROP", SLCGenericActionDrop, nullptr},
+      {"default-action=ACTION_ACCEPT", SLCGenericActionAccept, nullptr},
+      {"default-action=ACTION_DROPPED,extra", SLCGenericActionDrop, nullptr},
+      {"default-action=action_drop", SLCGenericActionAccept,
+       "Invalid default action specified: action_drop"},
+      {"default-action=ACTION_PUN", SLCGenericActionAccept,
+       "Invalid default action specified: ACTION_PUN"},
+      {"x default-action=ACTION_DROP", SLCGenericActionAccept, nullptr},
+      {"default-action", SLCGenericActionAccept, nullptr},
+  };
+  for (size_t i = 0; i < std::size(rows); i++) {
+    SCOPED_TRACE(rows[i].config);
+    const std::string agent = "cfg" + std::to_string(i);
+    ASSERT_EQ(CreateAgents(agent + ":" + rows[i].config), ZEL_OK);
+    host::Log::Clear();
+    EXPECT_EQ(Ctx(CreateFilter(agent, "one"))->defaultAction, rows[i].action);
+    EXPECT_EQ(Ctx(CreateFilter(agent, "two"))->defaultAction, rows[i].action);
+    EXPECT_EQ(host::Log::CountContaining("Invalid default action"), rows[i].complaint ? 2u : 0u);
+    if (rows[i].complaint) {
+      EXPECT_EQ(host::Log::Count(rows[i].complaint, 2), 2u);
+    }
   }
 }
 
-INSTANTIATE_TEST_SUITE_P(
-    Keywords, DefaultActionConfig,
-    ::testing::Values(
-        ConfigCase{"", SLCGenericActionAccept, nullptr},
-        ConfigCase{"default-action=ACTION_PUNT", SLCGenericActionPunt, nullptr},
-        ConfigCase{"default-action=ACTION_DROP", SLCGenericActionDrop, nullptr},
-        ConfigCase{"default-action=ACTION_ACCEPT", SLCGenericActionAccept, nullptr},
-        ConfigCase{"default-action=ACTION_DROPPED,extra", SLCGenericActionDrop, nullptr},
-        ConfigCase{"default-action=action_drop", SLCGenericActionAccept,
-                   "Invalid default action specified: action_drop"},
-        ConfigCase{"default-action=ACTION_PUN", SLCGenericActionAccept,
-                   "Invalid default action specified: ACTION_PUN"},
-        ConfigCase{"x default-action=ACTION_DROP", SLCGenericActionAccept, nullptr},
-        ConfigCase{"default-action", SLCGenericActionAccept, nullptr}));
-
-TEST_F(ModuleTest, AttachStateIsCopiedUnderTheConfigLock) {
-  host::FilterId id = CreateFilter();
-  host::Sluice::SetPolicy(host::RequestKind::SetSlowPath, testsupport::Replies(host::ReplyMode::Deferred));
-  ASSERT_EQ(host::Sluice::RegisterSlowPath(kDefaultAgent, 4), ZEL_OK);
-  EXPECT_EQ(Ctx(id)->spAttachState, SLCGenericSpDetached);
-  host::Timers::RunDue();
-  EXPECT_EQ(Ctx(id)->spAttachState, SLCGenericSpAttaching);
-  host::Sluice::ReleaseReplies(host::RequestKind::SetSlowPath);
-  EXPECT_EQ(Ctx(id)->spAttachState, SLCGenericSpAttached);
-  EXPECT_EQ(Filter(id)->spAttachState, SLCGenericSpAttached);
-}
-
-// --- No ruleset: the whole list by the default action ------------------------
-
-std::vector<std::vector<uint8_t>> Frames(size_t n) {
+// Without a ruleset the default action takes the whole list: punt needs a
+// slow path (attaching is enough, one hand-over per list), else the failure
+// policy drops (0) or passes (1); an unknown action touches nothing.
+TEST_F(ModuleTest, WithoutARulesetTheDefaultActionTakesTheWholeList) {
   std::vector<std::vector<uint8_t>> frames;
-  for (size_t i = 0; i < n; i++) {
-    frames.emplace_back(60 + i, static_cast<uint8_t>(i + 1));
-  }
-  return frames;
-}
-
-class NoRuleset : public ModuleTest {
- protected:
-  host::FilterId Make(const char* action, uint32_t failurePolicy) {
-    EXPECT_EQ(CreateAgents(std::string("def:default-action=") + action), ZEL_OK);
+  for (uint8_t i = 0; i < 4; i++) frames.emplace_back(60 + i, static_cast<uint8_t>(i + 1));
+  const struct { const char* action; uint32_t policy; bool attaching; ZelStatus status;
+                 bool passes, faulted; } rows[] = {
+      {"ACTION_ACCEPT", 0, false, ZEL_OK, true, false},
+      {"ACTION_DROP", 1, false, ZEL_OK, false, false},
+      {"ACTION_PUNT", 0, false, ZEL_OK, false, false},
+      {"ACTION_PUNT", 1, false, ZEL_OK, true, false},
+      {"ACTION_PUNT", 0, true, ZEL_OK, false, true},
+      {"bogus", 0, false, ZEL_FAILURE, true, false},
+  };
+  for (size_t i = 0; i < std::size(rows); i++) {
+    const auto& r = rows[i];
+    SCOPED_TRACE(i);
+    const std::string agent = "def" + std::to_string(i);
+    ASSERT_EQ(CreateAgents(agent + ":default-action=" + r.action), ZEL_OK);
     host::FilterConfig config;
-    config.failurePolicy = failurePolicy;
-    return CreateFilter("def", config);
+    config.failurePolicy = r.policy;
+    const host::FilterId id = CreateFilter(agent, config);
+    if (std::string(r.action) == "bogus") Ctx(id)->defaultAction = 42;
+    if (r.attaching) {
+      host::Sluice::SetPolicy(host::RequestKind::SetSlowPath,
+                              testsupport::Replies(host::ReplyMode::Deferred));
+      ASSERT_EQ(host::Sluice::RegisterSlowPath(agent, 1), ZEL_OK);
+      host::Timers::RunDue();
+      ASSERT_EQ(Ctx(id)->spAttachState, SLCGenericSpAttaching);
+    }
+    std::vector<std::vector<uint8_t>> passed;
+    EXPECT_EQ(Deliver(id, frames, 2, &passed), r.status);
+    EXPECT_EQ(passed, r.passes ? frames : decltype(frames){});
+    std::vector<host::Delivery> faulted = host::Sluice::TakeFaulted(id);
+    ASSERT_EQ(faulted.size(), r.faulted ? 1u : 0u);
+    if (r.faulted) {
+      EXPECT_EQ(faulted[0].direction, 2u);
+      std::vector<std::vector<uint8_t>> handed;
+      for (ZelPkt* p : faulted[0].packets) handed.push_back(host::Packets::Frame(p));
+      EXPECT_EQ(handed, frames);
+      testsupport::ReleaseDeliveries(&faulted);
+      host::Sluice::ReleaseReplies(host::RequestKind::SetSlowPath);
+    }
   }
-  void MakeAttaching(host::FilterId id) {
-    host::Sluice::SetPolicy(host::RequestKind::SetSlowPath, testsupport::Replies(host::ReplyMode::Deferred));
-    ASSERT_EQ(host::Sluice::RegisterSlowPath("def", 1), ZEL_OK);
-    host::Timers::RunDue();
-    ASSERT_EQ(Ctx(id)->spAttachState, SLCGenericSpAttaching);
-  }
-};
-
-TEST_F(NoRuleset, AcceptPassesEverything) {
-  host::FilterId id = Make("ACTION_ACCEPT", 0);
-  std::vector<std::vector<uint8_t>> passed;
-  EXPECT_EQ(Deliver(id, Frames(5), 1, &passed), ZEL_OK);
-  EXPECT_EQ(passed, Frames(5));
-  EXPECT_EQ(host::Sluice::FaultedCount(id), 0u);
-}
-
-TEST_F(NoRuleset, DropReleasesEverything) {
-  host::FilterId id = Make("ACTION_DROP", 1);
-  std::vector<std::vector<uint8_t>> passed;
-  EXPECT_EQ(Deliver(id, Frames(5), 2, &passed), ZEL_OK);
-  EXPECT_TRUE(passed.empty());
-  EXPECT_EQ(host::Packets::Live(), 0u);
-}
-
-TEST_F(NoRuleset, PuntWhileDetachedFollowsTheFailurePolicy) {
-  std::vector<std::vector<uint8_t>> passed;
-  host::FilterId closed = Make("ACTION_PUNT", 0);
-  EXPECT_EQ(Deliver(closed, Frames(3), 1, &passed), ZEL_OK);
-  EXPECT_TRUE(passed.empty());
-  EXPECT_EQ(host::Sluice::FaultedCount(closed), 0u);
-
-  host::FilterConfig open;
-  open.name = "open";
-  open.failurePolicy = 1;
-  host::FilterId openId = CreateFilter("def", open);
-  EXPECT_EQ(Deliver(openId, Frames(3), 1, &passed), ZEL_OK);
-  EXPECT_EQ(passed, Frames(3));
-  EXPECT_EQ(host::Sluice::FaultedCount(openId), 0u);
-}
-
-TEST_F(NoRuleset, PuntWhileAttachingHandsTheListOverInOneCall) {
-  host::FilterId id = Make("ACTION_PUNT", 0);
-  MakeAttaching(id);
-  std::vector<std::vector<uint8_t>> passed;
-  EXPECT_EQ(Deliver(id, Frames(4), 2, &passed), ZEL_OK);
-  EXPECT_TRUE(passed.empty());
-  std::vector<host::Delivery> faulted = host::Sluice::TakeFaulted(id);
-  ASSERT_EQ(faulted.size(), 1u);
-  EXPECT_EQ(faulted[0].direction, 2u);
-  ASSERT_EQ(faulted[0].packets.size(), 4u);
-  for (size_t i = 0; i < 4; i++) {
-    EXPECT_EQ(host::Packets::Frame(faulted[0].packets[i]), Frames(4)[i]);
-  }
-  testsupport::ReleaseDeliveries(&faulted);
-  host::Sluice::ReleaseReplies(host::RequestKind::SetSlowPath);
-}
-
-TEST_F(NoRuleset, UnknownDefaultActionTouchesNothing) {
-  host::FilterId id = Make("ACTION_ACCEPT", 0);
-  Ctx(id)->defaultAction = 42;
-  std::vector<std::vector<uint8_t>> passed;
-  EXPECT_EQ(Deliver(id, Frames(3), 1, &passed), ZEL_FAILURE);
-  EXPECT_EQ(passed, Frames(3));
-  EXPECT_EQ(host::Sluice::FaultedCount(id), 0u);
 }
 
 }  // namespace

@@ -188,15 +188,4 @@ TEST_F(SluiceBackendTest, SaveAndRestoreCarryTheSlowPathsBytes) {
   EXPECT_EQ(migsupport::Rules(Filter(dst)), migsupport::Rules(Filter(src)));
 }
 
-TEST_F(SluiceBackendTest, ARestoreWithNoSlowPathFollowsTheFailurePolicy) {
-  const Bytes saved = migsupport::SavedState(migsupport::SampleRules(), migsupport::Pattern(10));
-  const host::FilterId strict = NewFilter("strict", 0);
-  EXPECT_EQ(Sluice::RestoreState(strict, saved.data(), saved.size()), ZEL_FAILURE);
-  EXPECT_EQ(FWContext(Filter(strict))->numRules, 0u);
-  const host::FilterId lenient = NewFilter("lenient", 1);
-  EXPECT_EQ(Sluice::RestoreState(lenient, saved.data(), saved.size()), ZEL_OK);
-  EXPECT_EQ(FWContext(Filter(lenient))->numRules, 2u);
-  EXPECT_EQ(backend_.Waiting(), 0u) << "nothing to deliver the slow path's part to";
-}
-
 }  // namespace

@@ -1,6 +1,8 @@
 // Module start and stop: every start-up step failing in turn, the forms of
 // the log messages, parameters, and the module heap.
 
+#include <tuple>
+
 #include "module/module.h"
 #include "tests/support/module_fixture.h"
 
@@ -9,60 +11,46 @@ namespace {
 using testsupport::HostTest;
 using testsupport::ModuleTest;
 
-struct StartupFailure {
-  const char* call;
-  const char* message;   // rendered text for status 0xbad0014
-  host::LogForm form;
-};
-
-class StartupFailureTest : public HostTest,
-                           public ::testing::WithParamInterface<StartupFailure> {};
-
-TEST_P(StartupFailureTest, LeavesNothingBehindAndReturnsOne) {
-  const StartupFailure& f = GetParam();
-  host::Faults::Fail(f.call, ZEL_NO_MEMORY);
-
-  EXPECT_EQ(host::Loader::Load(&slcGenericModuleImage), 1);
-
-  EXPECT_EQ(slcGenericModuleID, -1);
-  EXPECT_EQ(slcGenericHeapID, nullptr);
-  EXPECT_EQ(slcGenericLogHandle, nullptr);
-  EXPECT_EQ(slcGenericTimerQueue, nullptr);
-  EXPECT_EQ(slcGenericLockDomain, ZEL_INVALID_LOCK_DOMAIN);
-  EXPECT_EQ(slcGenericPortClient, nullptr);
-  EXPECT_EQ(host::Heaps::LiveHeaps(), 0u);
-  EXPECT_EQ(host::Timers::LiveQueues(), 0u);
-  EXPECT_EQ(host::Locks::LiveDomains(), 0u);
-  EXPECT_FALSE(host::ClientPorts::Registered(kSLCGenericCreateAgentPropName));
-  EXPECT_FALSE(host::Sluice::AgentRegistered(kSLCGenericDefaultAgentName));
-
-  std::vector<host::LogRecord> records = host::Log::Records();
-  auto it = std::find_if(records.begin(), records.end(),
-                         [&](const host::LogRecord& r) { return r.text == f.message; });
-  ASSERT_NE(it, records.end()) << f.message;
-  EXPECT_EQ(it->urgency, 2);
-  EXPECT_EQ(it->form, f.form);
-  EXPECT_EQ(it->object, "");
-  EXPECT_FALSE(host::Loader::Loaded());
+// Each start-up step failing in turn: load returns 1, everything made so
+// far is undone, and the step's message (status 0xbad0014) is logged in its
+// form, naming no object.
+TEST_F(HostTest, StartupFailingAtEachStepLeavesNothingBehind) {
+  const struct { const char* call; const char* message; host::LogForm form; } rows[] = {
+      {"zel_HeapCreate", "Failed to create heap (0xbad0014): Out of memory", host::LogForm::Short},
+      {"zel_LogRegister", "Failed to allocate log handle (0xbad0014): Out of memory",
+       host::LogForm::Short},
+      {"zel_TimerQueueCreate", "Failed to create timer queue: Out of memory", host::LogForm::Long},
+      {"zel_LockDomainCreate", "Failed to create lock domain (0xbad0014): Out of memory",
+       host::LogForm::Long},
+      {"zel_PGXClientPortRegister",
+       "Failed to register sluice generic create agent prop handler (0xbad0014): Out of memory",
+       host::LogForm::Long},
+  };
+  for (const auto& f : rows) {
+    SCOPED_TRACE(f.call);
+    host::Log::Clear();
+    host::Faults::Fail(f.call, ZEL_NO_MEMORY);
+    EXPECT_EQ(host::Loader::Load(&slcGenericModuleImage), 1);
+    host::Faults::ClearAll();
+    EXPECT_EQ(slcGenericModuleID, -1);
+    EXPECT_EQ(slcGenericHeapID, nullptr);
+    EXPECT_EQ(slcGenericLogHandle, nullptr);
+    EXPECT_EQ(slcGenericTimerQueue, nullptr);
+    EXPECT_EQ(slcGenericLockDomain, ZEL_INVALID_LOCK_DOMAIN);
+    EXPECT_EQ(slcGenericPortClient, nullptr);
+    EXPECT_EQ(host::Heaps::LiveHeaps(), 0u);
+    EXPECT_EQ(host::Timers::LiveQueues(), 0u);
+    EXPECT_EQ(host::Locks::LiveDomains(), 0u);
+    EXPECT_FALSE(host::ClientPorts::Registered(kSLCGenericCreateAgentPropName));
+    EXPECT_FALSE(host::Sluice::AgentRegistered(kSLCGenericDefaultAgentName));
+    EXPECT_FALSE(host::Loader::Loaded());
+    const std::vector<host::LogRecord> records = host::Log::Records();
+    auto it = std::find_if(records.begin(), records.end(),
+                           [&](const host::LogRecord& r) { return r.text == f.message; });
+    ASSERT_NE(it, records.end());
+    EXPECT_EQ(std::tuple(it->urgency, it->form, it->object), std::tuple(2, f.form, std::string()));
+  }
 }
-
-INSTANTIATE_TEST_SUITE_P(
-    EachStep, StartupFailureTest,
-    ::testing::Values(
-        StartupFailure{"zel_HeapCreate", "Failed to create heap (0xbad0014): Out of memory",
-                       host::LogForm::Short},
-        StartupFailure{"zel_LogRegister",
-                       "Failed to allocate log handle (0xbad0014): Out of memory",
-                       host::LogForm::Short},
-        StartupFailure{"zel_TimerQueueCreate", "Failed to create timer queue: Out of memory",
-                       host::LogForm::Long},
-        StartupFailure{"zel_LockDomainCreate",
-                       "Failed to create lock domain (0xbad0014): Out of memory",
-                       host::LogForm::Long},
-        StartupFailure{"zel_PGXClientPortRegister",
-                       "Failed to register sluice generic create agent prop handler (0xbad0014): "
-                       "Out of memory",
-                       host::LogForm::Long}));
 
 TEST_F(HostTest, StartsWithDefaultAgentAndStopsCleanly) {
   ASSERT_EQ(host::Loader::Load(&slcGenericModuleImage), 0);

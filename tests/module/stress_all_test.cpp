@@ -19,9 +19,8 @@
 #include <shared_mutex>
 #include <thread>
 
-#include "control/control.h"
-#include "firewall/fw_ioctl.h"
 #include "host/control/control_host.h"
+#include "tests/control/control_test_util.h"
 #include "tests/support/migration_support.h"
 #include "tools/lib/frames.h"
 
@@ -32,8 +31,8 @@ using Clock = std::chrono::steady_clock;
 
 constexpr size_t kSlots = 4;
 constexpr uint32_t kSlowPathIds[] = {21, 22};
-const std::string kAgent = testsupport::kDefaultAgent;
-const std::string kProp = kAgent + ".ruleset";
+using controltest::kAgent;
+using controltest::kProp;
 
 template <typename Op>
 ZelStatus UntilNotBusy(Op op) {
@@ -54,14 +53,6 @@ Bytes EveryActionRules(uint8_t version) {
       .Add("action=l2rewrite rewrite=02:00:00:00:00:99 ipv4 proto=tcp da=10.7.7.7")
       .Add("action=gre gre=198.51.100.7 snaplen=64 ipv4 proto=udp da=10.7.7.7")
       .Bytes();
-}
-
-Bytes Msg(uint32_t type, uint32_t word, const Bytes& body = {}) {
-  Bytes m(8 + body.size());
-  std::memcpy(m.data(), &type, 4);
-  std::memcpy(m.data() + 4, &word, 4);
-  std::copy(body.begin(), body.end(), m.begin() + 8);
-  return m;
 }
 
 enum Kind { kPackets, kControl, kTreeReads, kSlowPathChurn, kRecreate, kSaves, kRestores, kKinds };
@@ -131,16 +122,15 @@ TEST_F(StressAllTest, EveryKindOfWorkAtOnceBalances) {
       const uint64_t op = rng() % 5;
       switch (op) {
         case 0: status = host::Sluice::PropertyWrite(kProp, ids[s], rs); break;
-        case 1: host::Sluice::SendIoctl(ids[s], 9, Msg(FWIoctlMsgRuleset, 1, rs)); break;
-        case 2: host::Sluice::SendIoctl(ids[s], 9, Bytes{FWIoctlMsgGetState, 0, 0, 0}); break;
+        case 1: host::Sluice::SendIoctl(ids[s], 9, controltest::Push(rs)); break;
+        case 2: host::Sluice::SendIoctl(ids[s], 9, controltest::GetState()); break;
         case 3: {
           // Rulesets are replaced, never added to: room for any of them.
-          Bytes req(sizeof(FWCharDevRequest) + 15 + 8 * 281, 0);
-          const uint32_t type = rng() % 2 ? FWCharDevReqSetRuleset : FWCharDevReqGetRuleset;
-          std::memcpy(req.data(), &type, 4);
-          const std::string name = "stress" + std::to_string(s);
-          std::memcpy(req.data() + offsetof(FWCharDevRequest, filterName), name.data(), name.size());
-          std::copy(rs.begin(), rs.end(), req.begin() + sizeof(FWCharDevRequest));
+          Bytes tail(15 + 8 * 281, 0);
+          std::copy(rs.begin(), rs.end(), tail.begin());
+          const Bytes req = controltest::DevRequest(
+              rng() % 2 ? FWCharDevReqSetRuleset : FWCharDevReqGetRuleset,
+              "stress" + std::to_string(s), tail);
           const uint64_t addr = host::UserMemory::Map(req);
           int32_t result = 0;
           status = host::CharDevs::Ioctl(kAgent, 0, addr, &result);

@@ -11,7 +11,7 @@ CTL_BIN=$2
 HERE=$(cd "$(dirname "$0")/../.." && pwd)
 
 . "$HERE/scripts/live-topology.sh"
-topo_require ip ping socat tcpdump timeout
+topo_require ip ping socat tcpdump timeout python3
 P="slt$$"
 DIR=$(mktemp -d /tmp/sluice-live.XXXXXX)
 SOCK="$DIR/ctl.sock"
@@ -29,34 +29,15 @@ trap cleanup EXIT
 trap 'exit 1' INT TERM
 
 ctl() { timeout 10 "$CTL_BIN" --socket "$SOCK" "$@"; }
-check() {  # check NAME COMMAND...
-  local name=$1; shift
-  if "$@"; then echo "ok   $name"; else echo "FAIL $name"; FAILED=1; fi
-}
+check() { topo_check "$@"; }
 in_ns() { local ns=$1; shift; ip netns exec "$P-$ns" "$@"; }
 set_rules() { printf '%s\n' "$@" | ctl ruleset set vm1.eth0 - >/dev/null; }
-# Sends COUNT UDP datagrams from vm to net port PORT (one line each).
-send_udp() {  # send_udp FROM_NS TO_ADDR PORT COUNT [PAYLOAD_BYTES]
-  local from=$1 addr=$2 port=$3 count=$4 size=${5:-16} i
-  local payload; payload=$(head -c "$size" /dev/zero | tr '\0' 'x')
-  for ((i = 0; i < count; i++)); do
-    echo "$payload" | in_ns "$from" timeout 2 socat -u - "UDP-SENDTO:$addr:$port" 2>/dev/null
-  done
-}
-# Receives UDP datagrams on PORT in namespace NS for SECONDS into FILE.
-recv_udp() {  # recv_udp NS PORT SECONDS FILE
-  # Started through ip directly (not a function) so that $! is the
-  # receiver and killing it ends it.
-  ip netns exec "$P-$1" timeout "$3" socat -u "UDP-RECV:$2" - >"$4" 2>/dev/null &
-  LAST_RECV=$!
-}
+send_udp() { local ns=$1; shift; topo_send_udp "$P-$ns" "$@"; }
+heap() { ctl --json stats | topo_json 'd["heapBytes"]'; }
 rule_packets() {  # rule_packets INDEX: packet counter of rule INDEX
   sleep 0.3  # the last frames may still sit in a receive ring block
-  ctl --json status --agent fw | python3 -c '
-import json, sys
-t = json.load(sys.stdin)
-rules = t["agents"][0]["filters"][0]["counters"]["rules"]
-print(next(r["packets"] for r in rules if r["position"] == int(sys.argv[1])))' "$1"
+  ctl --json status --agent fw | topo_json \
+    "next(r['packets'] for r in d['agents'][0]['filters'][0]['counters']['rules'] if r['position'] == $1)"
 }
 
 topo_up "$P" || { echo "FAIL could not make namespaces"; exit 1; }
@@ -68,7 +49,7 @@ ip netns exec "$P-fp" "$HOST_BIN" --socket "$SOCK" --gre kernel --max-seconds 80
 HOST_PID=$!
 for _ in $(seq 50); do ctl hello >/dev/null 2>&1 && break; sleep 0.1; done
 check "host answers" ctl hello
-HEAP0=$(ctl --json stats | python3 -c 'import json,sys; print(json.load(sys.stdin)["heapBytes"])')
+HEAP0=$(heap)
 
 # --- ping, UDP, TCP pass or drop as the rules say ---------------------------
 check "ping passes with no rules" in_ns vm ping -c 2 -i 0.2 -W 1 -q 10.77.0.2
@@ -76,7 +57,8 @@ set_rules "action=drop ipv4 proto=icmp" "action=drop ipv4 proto=udp dport=6000" 
   "action=drop ipv4 proto=tcp dport=7001"
 check "ping dropped by an icmp rule" bash -c "! ip netns exec $P-vm ping -c 2 -i 0.2 -W 1 -q 10.77.0.2"
 
-recv_udp net 5000 3 "$DIR/u5000"; R1=$LAST_RECV; recv_udp net 6000 3 "$DIR/u6000"; R2=$LAST_RECV
+topo_recv_udp "$P-net" 5000 3 "$DIR/u5000"; R1=$LAST_RECV
+topo_recv_udp "$P-net" 6000 3 "$DIR/u6000"; R2=$LAST_RECV
 sleep 0.3
 send_udp vm 10.77.0.2 5000 5; send_udp vm 10.77.0.2 6000 5; wait $R1 $R2
 check "udp to an open port arrives" test "$(wc -l <"$DIR/u5000")" -eq 5
@@ -100,8 +82,8 @@ check "accept counter equals datagrams sent" test "$(rule_packets 0)" = 12
 check "drop counter equals datagrams sent" test "$(rule_packets 1)" = 7
 
 # --- rules changed while traffic flows lose no accepted packet ----------------
-recv_udp net 5200 30 "$DIR/u5200"; sleep 0.3
-( send_udp vm 10.77.0.2 5200 150 ) &
+topo_recv_udp "$P-net" 5200 30 "$DIR/u5200"; sleep 0.3
+( send_udp vm 10.77.0.2 5200 150 16 0.01 ) &
 SENDER=$!
 for i in $(seq 15); do
   set_rules "action=accept ipv4 proto=udp dport=5200" "action=drop ipv4 proto=udp dport=$((6100 + i))"
@@ -145,7 +127,7 @@ check "device get by name shows it" bash -c "'$CTL_BIN' --socket '$SOCK' dev get
 check "device test ioctl" ctl dev test --filter vm1.eth0
 
 # --- hostile rulesets on a live filter: refused, host up, heap unchanged -------
-HEAP1=$(ctl --json stats | python3 -c 'import json,sys; print(json.load(sys.stdin)["heapBytes"])')
+HEAP1=$(heap)
 ctl ruleset get vm1.eth0 --wire "$DIR/good.bin"
 python3 - "$DIR" <<'PY'
 import struct, sys
@@ -163,7 +145,7 @@ for f in many short noise; do
   check "device refuses a $f ruleset" bash -c "! '$CTL_BIN' --socket '$SOCK' dev set --filter vm1.eth0 --wire '$DIR/$f.bin' 2>/dev/null"
 done
 check "the rules in force survive hostile rulesets" bash -c "'$CTL_BIN' --socket '$SOCK' ruleset get vm1.eth0 | grep -q 'dport=5600'"
-HEAP2=$(ctl --json stats | python3 -c 'import json,sys; print(json.load(sys.stdin)["heapBytes"])')
+HEAP2=$(heap)
 check "heap unchanged by hostile rulesets ($HEAP1 -> $HEAP2)" test "$HEAP1" = "$HEAP2"
 
 # --- ports come and go while the host runs --------------------------------------

@@ -35,42 +35,9 @@ trap cleanup EXIT
 trap 'exit 1' INT TERM
 
 ctl() { local sock=$1; shift; timeout 20 "$CTL_BIN" --socket "$DIR/$sock.sock" "$@"; }
-check() {  # check NAME COMMAND...
-  local name=$1; shift
-  if "$@"; then echo "ok   $name"; else echo "FAIL $name"; FAILED=1; fi
-}
-# Waits up to 5 s for a line matching PATTERN in FILE.
-wait_for() {  # wait_for FILE PATTERN
-  local i
-  for i in $(seq 50); do
-    grep -q -- "$2" "$1" 2>/dev/null && return 0
-    sleep 0.1
-  done
-  return 1
-}
-# Waits up to 5 s for at least N lines matching PATTERN in FILE.
-wait_for_n() {  # wait_for_n FILE PATTERN N
-  local i
-  for i in $(seq 50); do
-    [ "$(grep -c -- "$2" "$1" 2>/dev/null)" -ge "$3" ] && return 0
-    sleep 0.1
-  done
-  return 1
-}
-# Sends COUNT one-line UDP datagrams from namespace NS to ADDR:PORT.
-send_udp() {  # send_udp NS ADDR PORT COUNT [GAP_SECONDS]
-  ip netns exec "$1" python3 -c '
-import socket, sys, time
-s = socket.socket(socket.AF_INET, socket.SOCK_DGRAM)
-for i in range(int(sys.argv[3])):
-    s.sendto(b"d%d\n" % i, (sys.argv[1], int(sys.argv[2])))
-    time.sleep(float(sys.argv[4]))' "$2" "$3" "$4" "${5:-0.002}"
-}
-# Counts datagrams received on PORT in namespace NS until stopped.
-recv_udp() {  # recv_udp NS PORT FILE; sets LAST_RECV
-  ip netns exec "$1" timeout 20 socat -u "UDP-RECV:$2" - >"$3" 2>/dev/null &
-  LAST_RECV=$!
-}
+check() { topo_check "$@"; }
+wait_for() { topo_wait_for "$@"; }
+send_udp() { topo_send_udp "$1" "$2" "$3" "$4" 16 "${5:-0.002}"; }
 lines() { wc -l <"$1" | tr -d ' '; }
 # Starts a slow path with commands from a FIFO: start_sp NAME HOST [OPTIONS...]
 start_sp() {
@@ -84,25 +51,15 @@ start_sp() {
 sp_cmd() { echo "$2" >"$DIR/$1.in"; }
 # Packet counters of the rules of host HOST's port, space separated.
 rule_counts() {
-  ctl "$1" --json status --agent fw | python3 -c '
-import json, sys
-t = json.load(sys.stdin)
-fs = t["agents"][0]["filters"]
-print(" ".join(str(r["packets"]) for r in fs[0]["counters"]["rules"]) if fs else "none")'
+  ctl "$1" --json status --agent fw | topo_json \
+    '" ".join(str(r["packets"]) for r in d["agents"][0]["filters"][0]["counters"]["rules"]) if d["agents"][0]["filters"] else "none"'
 }
-ports_of() {
-  ctl "$1" --json stats | python3 -c '
-import json, sys
-print(" ".join(p["name"] for p in json.load(sys.stdin)["ports"]) or "none")'
-}
+ports_of() { ctl "$1" --json stats | topo_json '" ".join(p["name"] for p in d["ports"]) or "none"'; }
 slowpaths_of() {
-  ctl "$1" --json stats | python3 -c '
-import json, sys
-print(" ".join(s["name"] + ":" + ",".join(s["filters"]) for s in json.load(sys.stdin)["slowPaths"]) or "none")'
+  ctl "$1" --json stats |
+    topo_json '" ".join(s["name"] + ":" + ",".join(s["filters"]) for s in d["slowPaths"]) or "none"'
 }
-heap_of() {
-  ctl "$1" --json stats | python3 -c 'import json,sys; print(json.load(sys.stdin)["heapBytes"])'
-}
+heap_of() { ctl "$1" --json stats | topo_json 'd["heapBytes"]'; }
 # One round of traffic from the VM in namespace prefix PFX: 4 datagrams to
 # an accepted port, 3 to a dropped one, 5 to a punted one (sent back by the
 # slow path), then a marker; the receiver stops once the marker and the 5
@@ -194,8 +151,8 @@ check "stats show the link and what passed over it" stats_show_link
 # sends its copy back too.
 echo "action=copy ipv4 proto=udp dport=5200" >"$DIR/copy.txt"
 sp_cmd a1 "push vm1 $DIR/copy.txt"
-check "copy rule pushed" wait_for_n "$DIR/a1.out" "push vm1 status=1" 2
-recv_udp "$P-net" 5200 "$DIR/c5200"; C1=$LAST_RECV
+check "copy rule pushed" wait_for "$DIR/a1.out" "push vm1 status=1" 2
+topo_recv_udp "$P-net" 5200 20 "$DIR/c5200"; C1=$LAST_RECV
 sleep 0.3
 send_udp "$P-vm" 10.77.0.2 5200 3
 sleep 0.5
@@ -203,12 +160,12 @@ kill $C1 2>/dev/null; wait $C1 2>/dev/null
 check "copies reach the slow path" test "$(grep -c "packet vm1 dir=2" "$DIR/a1.out")" -eq 8
 check "originals and returned copies arrive" test "$(lines "$DIR/c5200")" -eq 6
 sp_cmd a1 "push vm1 $DIR/rules.txt"
-check "rules pushed back" wait_for_n "$DIR/a1.out" "push vm1 status=1" 3
+check "rules pushed back" wait_for "$DIR/a1.out" "push vm1 status=1" 3
 
 # --- killing a slow path mid-stream loses nothing the rules accept ------------
 start_sp a2 A --reissue
 check "a second slow path registers" wait_for "$DIR/a2.out" "registered"
-recv_udp "$P-net" 5200 "$DIR/k5200"; K1=$LAST_RECV
+topo_recv_udp "$P-net" 5200 20 "$DIR/k5200"; K1=$LAST_RECV
 sleep 0.3
 ( send_udp "$P-vm" 10.77.0.2 5200 300 0.004 ) &
 S1=$!

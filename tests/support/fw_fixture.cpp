@@ -1,6 +1,7 @@
 #include "tests/support/fw_fixture.h"
 
 #include "module/module.h"
+#include "tests/support/migration_support.h"
 
 namespace testsupport {
 
@@ -20,25 +21,10 @@ void FirewallTest::TearDown() {
 }
 
 ZelStatus FirewallTest::Apply(const std::vector<uint8_t>& ruleset, bool replace, bool fromIoctl) {
-  // The module may read the header through a pointer to FWRuleset; give it
-  // a private copy so a read past the records shows up under ASan.
-  std::vector<uint8_t> copy(ruleset);
-  SLCGenericWriteGuard guard(ctx_->configLock);
-  return FWApplyRuleset(filter_, reinterpret_cast<FWRuleset*>(copy.data()), replace ? 1 : 0,
-                        fromIoctl ? 1 : 0);
+  return migsupport::Install(filter_, ruleset, replace ? 1 : 0, fromIoctl ? 1 : 0);
 }
 
-std::vector<uint8_t> FirewallTest::Populate() {
-  SLCGenericReadGuard guard(ctx_->configLock);
-  std::vector<uint8_t> buf(FW_RULESET_HEADER_SIZE + size_t{FW_RULE_SIZE_V8} * ctx_->numRules);
-  FWPopulateRuleset(ctx_, reinterpret_cast<FWRuleset*>(buf.data()));
-  FWRulesetHeader h;
-  std::memcpy(&h, buf.data(), sizeof(h));
-  uint64_t size = 0;
-  EXPECT_EQ(FWGetRuleSize(h.version, &size), ZEL_OK);
-  buf.resize(FW_RULESET_HEADER_SIZE + size * h.numRules);
-  return buf;
-}
+std::vector<uint8_t> FirewallTest::Populate() { return migsupport::Rules(filter_); }
 
 void FirewallTest::Clear() {
   SLCGenericWriteGuard guard(ctx_->configLock);

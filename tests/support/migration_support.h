@@ -59,10 +59,13 @@ inline Bytes SavedState(const Bytes& fast, const Bytes& slow = {}) {
   return out;
 }
 
-// Installs `ruleset` as a property write would, holding configLock.
-inline ZelStatus Install(SLCGenericFilter* filter, Bytes ruleset, uint32_t replace = 1) {
+// Installs `ruleset` as a property write (or an ioctl push) would, holding
+// configLock. The module reads the header through a pointer to FWRuleset:
+// the private copy lets a read past the records show up under ASan.
+inline ZelStatus Install(SLCGenericFilter* filter, Bytes ruleset, uint32_t replace = 1,
+                         uint32_t fromIoctl = 0) {
   SLCGenericWriteGuard config(FWContext(filter)->configLock);
-  return FWApplyRuleset(filter, reinterpret_cast<FWRuleset*>(ruleset.data()), replace, 0);
+  return FWApplyRuleset(filter, reinterpret_cast<FWRuleset*>(ruleset.data()), replace, fromIoctl);
 }
 
 // The filter's ruleset as FWPopulateRuleset writes it, records of its version's size.

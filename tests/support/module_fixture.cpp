@@ -101,20 +101,15 @@ void ReleaseDeliveries(std::vector<host::Delivery>* deliveries) {
   }
 }
 
-size_t ModuleTest::DrainFaulted(host::FilterId id) {
-  std::vector<host::Delivery> deliveries = host::Sluice::TakeFaulted(id);
+// Releases the packets of the deliveries and returns how many there were.
+static size_t Drain(std::vector<host::Delivery> deliveries) {
   size_t n = 0;
   for (const auto& d : deliveries) n += d.packets.size();
   ReleaseDeliveries(&deliveries);
   return n;
 }
 
-size_t ModuleTest::DrainIssued(host::FilterId id) {
-  std::vector<host::Delivery> deliveries = host::Sluice::TakeIssued(id);
-  size_t n = 0;
-  for (const auto& d : deliveries) n += d.packets.size();
-  ReleaseDeliveries(&deliveries);
-  return n;
-}
+size_t ModuleTest::DrainFaulted(host::FilterId id) { return Drain(host::Sluice::TakeFaulted(id)); }
+size_t ModuleTest::DrainIssued(host::FilterId id) { return Drain(host::Sluice::TakeIssued(id)); }
 
 }  // namespace testsupport

@@ -11,21 +11,16 @@
 #include <fstream>
 #include <random>
 
+#include "tests/support/tool_frames.h"
+
 namespace {
 
-using frames::Bytes;
-using frames::CaptureRecord;
-using frames::FrameBuilder;
-
-const frames::MacAddr kVm = frames::Mac("02:00:00:00:00:10");
-const frames::MacAddr kGw = frames::Mac("02:00:00:00:00:01");
+using namespace toolframes;
 
 std::vector<CaptureRecord> Mixed() {
   return {
-      {1, FrameBuilder().Eth(kVm, kGw).Ipv4(frames::Ip4("10.0.0.1"), frames::Ip4("10.0.0.10"))
-              .Tcp(1, 80).Build(), 0, 1700000000, 123456789},
-      {2, FrameBuilder().Eth(kGw, kVm).Ipv4(frames::Ip4("10.0.0.10"), frames::Ip4("10.0.0.1"))
-              .Udp(5, 6).Payload(100).Build(), 0, 1700000001, 1},
+      {1, FromSwitch().Tcp(1, 80).Build(), 0, 1700000000, 123456789},
+      {2, ToSwitch().Udp(5, 6).Payload(100).Build(), 0, 1700000001, 1},
       {1, Bytes{1, 2, 3}, 1500, 1700000002, 999999999},
   };
 }

@@ -4,9 +4,11 @@
 
 #include <gtest/gtest.h>
 
+#include <tuple>
+
 #include "host/sluice/framework.h"
 #include "tests/support/module_fixture.h"
-#include "tools/lib/frames.h"
+#include "tests/support/tool_frames.h"
 #include "tools/lib/verdict_diff.h"
 
 namespace {
@@ -129,45 +131,40 @@ TEST(Diff, PairsRulesByWhatTheyMatch) {
       "action=gre proto=udp gre=192.0.2.2\n"
       "action=accept proto=tcp dport=80\n"
       "action=punt proto=tcp dport=23\n");
-  const std::vector<rules::RuleChange> got = rules::DiffRules(a, b);
   // Identical rules pair first, wherever they moved; the GRE rule pairs by
-  // what it matches and shows its new destination.
-  ASSERT_EQ(got.size(), 4u);
-  EXPECT_EQ(got[0].kind, rules::RuleChange::kChanged);  // the header
-  EXPECT_EQ(got[0].oldLine, 0u);
-  EXPECT_EQ(got[0].oldText, "ruleset version=8 features=drop-bpdu frag=none");
-  EXPECT_EQ(got[0].newText, "ruleset version=8 features=none frag=none");
-  EXPECT_EQ(got[1].kind, rules::RuleChange::kRemoved);
-  EXPECT_EQ(got[1].oldLine, 2u);
-  EXPECT_EQ(got[1].oldText, "action=drop proto=tcp dport=22");
-  EXPECT_EQ(got[2].kind, rules::RuleChange::kChanged);
-  EXPECT_EQ(got[2].oldLine, 3u);
-  EXPECT_EQ(got[2].newLine, 2u);
-  EXPECT_EQ(got[2].oldText, "action=gre proto=udp gre=192.0.2.1");
-  EXPECT_EQ(got[2].newText, "action=gre proto=udp gre=192.0.2.2");
-  EXPECT_EQ(got[3].kind, rules::RuleChange::kAdded);
-  EXPECT_EQ(got[3].newLine, 4u);
-  EXPECT_EQ(got[3].newText, "action=punt proto=tcp dport=23");
+  // what it matches and shows its new destination; the header comes first.
+  using C = rules::RuleChange;
+  using Row = std::tuple<C::Kind, size_t, size_t, std::string, std::string>;
+  const std::vector<Row> want = {
+      {C::kChanged, 0, 0, "ruleset version=8 features=drop-bpdu frag=none",
+       "ruleset version=8 features=none frag=none"},
+      {C::kRemoved, 2, 0, "action=drop proto=tcp dport=22", ""},
+      {C::kChanged, 3, 2, "action=gre proto=udp gre=192.0.2.1", "action=gre proto=udp gre=192.0.2.2"},
+      {C::kAdded, 0, 4, "", "action=punt proto=tcp dport=23"},
+  };
+  std::vector<Row> got;
+  for (const C& c : rules::DiffRules(a, b)) {
+    got.emplace_back(c.kind, c.oldLine, c.newLine, c.oldText, c.newText);
+  }
+  EXPECT_EQ(got, want);
   EXPECT_TRUE(rules::DiffRules(a, a).empty());
 }
 
 TEST(Diff, CaptureVerdictsComeFromTheModule) {
-  using frames::FrameBuilder;
+  using namespace toolframes;
   using frames::Ip4;
-  using frames::Mac;
-  const auto vm = Mac("02:00:00:00:00:10"), gw = Mac("02:00:00:00:00:01");
   auto tcp = [&](uint16_t dport, uint8_t last = 1) {
     frames::Ip4Addr src = Ip4("10.0.0.1");
     src[3] = last;
-    return FrameBuilder().Eth(vm, gw).Ipv4(src, Ip4("10.0.0.10")).Tcp(40000, dport).Build();
+    return FrameBuilder().Eth(kVm, kGw).Ipv4(src, Ip4("10.0.0.10")).Tcp(40000, dport).Build();
   };
   const std::vector<frames::CaptureRecord> capture = {
       {1, tcp(22), 0},                 // 1: general drop -> general accept
       {1, tcp(80), 0},                 // 2: exact accept on both sides
       {1, tcp(80, 7), 0},              // 3: no rule -> default drop
       {2, tcp(23), 0},                 // 4: same drop both sides
-      {1, FrameBuilder().Eth(gw, vm).Arp(1, vm, Ip4("10.0.0.10"), Mac("00:00:00:00:00:00"),
-                                         Ip4("10.0.0.1")).Build(), 0},  // 5: ARP: default drop
+      {1, FrameBuilder().Eth(kGw, kVm).Arp(1, kVm, Ip4("10.0.0.10"), {}, Ip4("10.0.0.1")).Build(),
+       0},  // 5: ARP: default drop
   };
   const std::string exact =
       "action=accept dmac=02:00:00:00:00:10 smac=02:00:00:00:00:01 vlan=none ipv4 sa=10.0.0.1 "

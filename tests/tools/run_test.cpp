@@ -8,25 +8,15 @@
 
 #include <map>
 
+#include "tests/support/tool_frames.h"
 #include "tools/lib/ruleset_builder.h"
 
 namespace {
 
-using frames::Bytes;
-using frames::CaptureRecord;
-using frames::FrameBuilder;
-
-const frames::MacAddr kVm = frames::Mac("02:00:00:00:00:10");
-const frames::MacAddr kGw = frames::Mac("02:00:00:00:00:01");
+using namespace toolframes;
 
 Bytes Tcp(uint16_t dport, size_t payload = 20, bool toSwitch = false) {
-  FrameBuilder b;
-  if (toSwitch) {
-    b.Eth(kGw, kVm).Ipv4(frames::Ip4("10.0.0.10"), frames::Ip4("10.0.0.1"));
-  } else {
-    b.Eth(kVm, kGw).Ipv4(frames::Ip4("10.0.0.1"), frames::Ip4("10.0.0.10"));
-  }
-  return b.Tos(0x01).Tcp(40000, dport).Payload(payload).Build();
+  return (toSwitch ? ToSwitch() : FromSwitch()).Tos(0x01).Tcp(40000, dport).Payload(payload).Build();
 }
 
 // One rule per action, told apart by destination port; the exact one comes
