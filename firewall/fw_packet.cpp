@@ -320,19 +320,21 @@ void FWApplyAction(FWWalk* walk, ZelPkt* pkt, uint32_t action, FWRuleEntry* entr
 //   - kParseAhead packets ahead, a packet is parsed into a ring slot, its
 //     tuple hashed and its bucket head prefetched;
 //   - kEntryAhead packets ahead, the bucket's oldest entry (where the probe
-//     starts) is prefetched;
+//     starts) is prefetched, and kNextEntryAhead packets ahead the one
+//     after it when the oldest will not match;
 //   - then the verdict runs on the parsed slot, with the main iterator on
 //     that packet.
 // Only the current packet is ever removed or replaced, and nothing is
 // inserted, so the iterator ahead and the parsed slots stay valid and the
 // main iterator reaches each slot's packet in order. Parsing a packet early
 // changes nothing: packets ahead are not touched by the current verdict.
-// The ring takes kRingSize * 144 bytes (2.3 KiB) of the walk's stack.
+// The ring takes kRingSize * 144 bytes (4.5 KiB) of the walk's stack.
 constexpr uint32_t kRingSize = 32;  // power of two, > kParseAhead
 constexpr uint32_t kParseAhead = 24;
 constexpr uint32_t kEntryAhead = 12;
+constexpr uint32_t kNextEntryAhead = 6;
 static_assert((kRingSize & (kRingSize - 1)) == 0 && kParseAhead < kRingSize &&
-              kEntryAhead < kParseAhead);
+              kNextEntryAhead < kEntryAhead && kEntryAhead < kParseAhead);
 // Tables with at least this many buckets (a few thousand exact rules) take
 // the pipelined walk: their bucket heads and the entries behind them no
 // longer sit in the per-core caches, and a walk that waits for each miss in
@@ -422,15 +424,33 @@ __attribute__((always_inline)) inline void FWParseInto(ZelPkt* pkt, FWParsedPkt*
 // The first rule entry the exact probe will compare (its bucket's oldest),
 // three cache lines of it: links and hash, match fields and counters,
 // direction.
+__attribute__((always_inline)) inline void FWPrefetchLines(const ListLinks* link) {
+  const char* e = reinterpret_cast<const char*>(link);
+  __builtin_prefetch(e);
+  __builtin_prefetch(e + 64);
+  __builtin_prefetch(e + 128);
+}
+
 __attribute__((always_inline)) inline void FWPrefetchEntry(const FWParsedPkt* slot) {
   const ListLinks* bucket = slot->bucket;
   if (bucket == nullptr) return;
   const ListLinks* oldest = bucket->prev;
-  if (oldest == bucket) return;
-  const char* e = reinterpret_cast<const char*>(oldest);
-  __builtin_prefetch(e);
-  __builtin_prefetch(e + 64);
-  __builtin_prefetch(e + 128);
+  if (oldest != bucket) FWPrefetchLines(oldest);
+}
+
+// The bucket's second entry, when the oldest (requested kEntryAhead -
+// kNextEntryAhead packets earlier) has another hash, so that the probe
+// will go on to it: about one packet in ten at a quarter load.
+__attribute__((always_inline)) inline void FWPrefetchNextEntry(const FWParsedPkt* slot) {
+  const ListLinks* bucket = slot->bucket;
+  if (bucket == nullptr) return;
+  const ListLinks* oldest = bucket->prev;
+  if (oldest == bucket ||
+      FWEntryFromLink(const_cast<ListLinks*>(oldest))->hash == static_cast<uint32_t>(slot->hash)) {
+    return;
+  }
+  const ListLinks* second = oldest->prev;
+  if (second != bucket) FWPrefetchLines(second);
 }
 
 // Rule counters are plain adds under the shared hold: walks on other
@@ -528,6 +548,9 @@ void FWWalkList(FWWalk* walk, ZelPktList* list, ZelPktListIter* ahead) {
     }
     if (parsed - done > kEntryAhead) {
       FWPrefetchEntry(&ring[(done + kEntryAhead) & (kRingSize - 1)]);
+    }
+    if (parsed - done > kNextEntryAhead) {
+      FWPrefetchNextEntry(&ring[(done + kNextEntryAhead) & (kRingSize - 1)]);
     }
     FWDecide(walk, &ring[done++ & (kRingSize - 1)], early, haveGeneralRules);
   }
