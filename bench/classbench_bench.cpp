@@ -201,116 +201,111 @@ FWRule MixedRecordOf(const Rule4& x, uint32_t i, bool* matchesNothing) {
   return r;
 }
 
-// Replaces the rules of `priv` with `a` and `b` in turn, `rounds` times,
-// while another thread sends `lists` through the packet path; the longest
-// packet call seen while replacing, and the mean replacement, in ms.
+// The longest packet call, in ms, and the mean change, in ms, while rules
+// change under packets, and the longest exclusive hold of configLock.
 struct HoldResult {
   double stallMs, applyMs, holdMs;
 };
 
+// Sends `lists` through the packet path of `priv` on a thread of its own
+// until destroyed, and keeps the longest call made while a change is under
+// way (between Begin and End).
+class PacketFlow {
+ public:
+  PacketFlow(void* priv, std::vector<std::unique_ptr<host::PacketList>>& lists)
+      : thread_([this, priv, &lists] {
+          size_t next = 0;
+          while (!stop_.load(std::memory_order_relaxed)) {
+            const bool during = changing_.load(std::memory_order_acquire);
+            const double t0 = now_ns();
+            (void)SLCGenericProcessPackets(priv, lists[next]->get(), 1);
+            const double took = now_ns() - t0;
+            if ((during || changing_.load(std::memory_order_acquire)) && took > worst_.load()) {
+              worst_.store(took);
+            }
+            if (++next == lists.size()) next = 0;
+          }
+        }) {}
+  ~PacketFlow() {
+    stop_.store(true);
+    thread_.join();
+  }
+  void Begin() { changing_.store(true, std::memory_order_release); }
+  void End() {
+    std::this_thread::sleep_for(std::chrono::milliseconds(2));  // the stalled call ends
+    changing_.store(false, std::memory_order_release);
+  }
+  double WorstMs() const { return worst_.load() / 1e6; }
+
+ private:
+  std::atomic<bool> stop_{false}, changing_{false};
+  std::atomic<double> worst_{0};
+  std::thread thread_;
+};
+
+// `rs` in place of the rules of `filter` (replace 1) or beside them (0):
+// through the filter-ioctl road when `prepared`, else whole under the
+// exclusive hold.
+ZelStatus ChangeRules(SLCGenericFilter* filter, std::vector<uint8_t> bytes, uint32_t replace,
+                      bool prepared) {
+  auto* rs = reinterpret_cast<FWRuleset*>(bytes.data());
+  if (prepared) return FWSetIoctlRuleset(filter, rs, replace);
+  SLCGenericWriteGuard guard(FWContext(filter)->configLock);
+  return FWApplyRuleset(filter, rs, replace, 1);
+}
+
+// Replaces the rules of `priv` with `a` and `b` in turn, `rounds` times,
+// while packets flow.
 HoldResult MeasureHold(void* priv, std::vector<std::unique_ptr<host::PacketList>>& lists,
                        const std::vector<uint8_t>& a, const std::vector<uint8_t>& b,
                        bool prepared, int rounds) {
   auto* filter = static_cast<SLCGenericFilter*>(priv);
-  std::atomic<bool> stop{false}, applying{false};
-  std::atomic<double> worst{0};
-  std::thread packets([&] {
-    size_t next = 0;
-    while (!stop.load(std::memory_order_relaxed)) {
-      const bool during = applying.load(std::memory_order_acquire);
-      const double t0 = now_ns();
-      (void)SLCGenericProcessPackets(priv, lists[next]->get(), 1);
-      const double took = now_ns() - t0;
-      if ((during || applying.load(std::memory_order_acquire)) && took > worst.load()) {
-        worst.store(took);
-      }
-      if (++next == lists.size()) next = 0;
-    }
-  });
   double total = 0;
+  PacketFlow flow(priv, lists);
   host::Locks::ResetWriteHolds("slcg.fw.config");
   for (int r = 0; r < rounds; r++) {
-    std::vector<uint8_t> copy(r % 2 == 0 ? a : b);
-    auto* rs = reinterpret_cast<FWRuleset*>(copy.data());
-    applying.store(true, std::memory_order_release);
+    flow.Begin();
     const double t0 = now_ns();
-    ZelStatus st;
-    if (prepared) {
-      st = FWSetIoctlRuleset(filter, rs, 1);
-    } else {
-      SLCGenericWriteGuard guard(FWContext(filter)->configLock);
-      st = FWApplyRuleset(filter, rs, 1, 1);
-    }
+    const ZelStatus st = ChangeRules(filter, r % 2 == 0 ? a : b, 1, prepared);
     total += now_ns() - t0;
-    std::this_thread::sleep_for(std::chrono::milliseconds(2));  // the stalled call ends
-    applying.store(false, std::memory_order_release);
+    flow.End();
     if (st != ZEL_OK) {
       std::fprintf(stderr, "replacement failed\n");
       std::abort();
     }
   }
-  stop.store(true);
-  packets.join();
-  return {worst.load() / 1e6, total / rounds / 1e6,
+  return {flow.WorstMs(), total / rounds / 1e6,
           static_cast<double>(host::Locks::LongestWriteHoldNs("slcg.fw.config")) / 1e6};
 }
 
-// Resets the rules of `priv` to `base`, then adds `extra` to them (replace
-// 0), `rounds` times, while another thread sends `lists` through the packet
-// path. Only the additions are measured: the longest exclusive hold among
-// them, the longest packet call during them, and the mean addition.
+// Resets the rules of `priv` to `base`, then adds `extra` to them, `rounds`
+// times, while packets flow. Only the additions are measured.
 HoldResult MeasureAddHold(void* priv, std::vector<std::unique_ptr<host::PacketList>>& lists,
                           const std::vector<uint8_t>& base, const std::vector<uint8_t>& extra,
                           bool prepared, int rounds) {
   auto* filter = static_cast<SLCGenericFilter*>(priv);
-  std::atomic<bool> stop{false}, applying{false};
-  std::atomic<double> worst{0};
-  std::thread packets([&] {
-    size_t next = 0;
-    while (!stop.load(std::memory_order_relaxed)) {
-      const bool during = applying.load(std::memory_order_acquire);
-      const double t0 = now_ns();
-      (void)SLCGenericProcessPackets(priv, lists[next]->get(), 1);
-      const double took = now_ns() - t0;
-      if ((during || applying.load(std::memory_order_acquire)) && took > worst.load()) {
-        worst.store(took);
-      }
-      if (++next == lists.size()) next = 0;
-    }
-  });
   double total = 0;
   uint64_t longest = 0;
+  PacketFlow flow(priv, lists);
   for (int r = 0; r < rounds; r++) {
-    std::vector<uint8_t> reset(base);
-    if (FWSetIoctlRuleset(filter, reinterpret_cast<FWRuleset*>(reset.data()), 1) != ZEL_OK) {
+    if (ChangeRules(filter, base, 1, true) != ZEL_OK) {
       std::fprintf(stderr, "reset failed\n");
       std::abort();
     }
     std::this_thread::sleep_for(std::chrono::milliseconds(2));
-    std::vector<uint8_t> copy(extra);
-    auto* rs = reinterpret_cast<FWRuleset*>(copy.data());
     host::Locks::ResetWriteHolds("slcg.fw.config");
-    applying.store(true, std::memory_order_release);
+    flow.Begin();
     const double t0 = now_ns();
-    ZelStatus st;
-    if (prepared) {
-      st = FWSetIoctlRuleset(filter, rs, 0);
-    } else {
-      SLCGenericWriteGuard guard(FWContext(filter)->configLock);
-      st = FWApplyRuleset(filter, rs, 0, 1);
-    }
+    const ZelStatus st = ChangeRules(filter, extra, 0, prepared);
     total += now_ns() - t0;
-    std::this_thread::sleep_for(std::chrono::milliseconds(2));  // the stalled call ends
-    applying.store(false, std::memory_order_release);
+    flow.End();
     longest = std::max(longest, host::Locks::LongestWriteHoldNs("slcg.fw.config"));
     if (st != ZEL_OK) {
       std::fprintf(stderr, "addition failed\n");
       std::abort();
     }
   }
-  stop.store(true);
-  packets.join();
-  return {worst.load() / 1e6, total / rounds / 1e6, static_cast<double>(longest) / 1e6};
+  return {flow.WorstMs(), total / rounds / 1e6, static_cast<double>(longest) / 1e6};
 }
 
 class Bench {

@@ -352,26 +352,26 @@ constexpr uint32_t kLookahead = 2;
 
 struct FWLookahead {
   ZelPktListIter* iter;
+  ZelPkt* ahead;              // the iterator's packet, its object requested; null at the end
   ZelPkt* queue[kLookahead];  // oldest first; null past the end
 };
 
 __attribute__((always_inline)) inline void FWLookaheadStep(FWLookahead* la) {
   for (uint32_t i = 0; i + 1 < kLookahead; i++) la->queue[i] = la->queue[i + 1];
-  ZelPktListIter* iter = la->iter;
-  if (zel_PktListIterIsAtEnd(iter)) {
-    la->queue[kLookahead - 1] = nullptr;
-    return;
-  }
-  ZelPkt* pkt = zel_PktListIterGetPkt(iter);
-  __builtin_prefetch(zel_PktFrameMappedPointerGet(pkt));
-  zel_PktListIterMove(iter);
-  if (!zel_PktListIterIsAtEnd(iter)) __builtin_prefetch(zel_PktListIterGetPkt(iter));
+  ZelPkt* pkt = la->ahead;
   la->queue[kLookahead - 1] = pkt;
+  if (pkt == nullptr) return;
+  __builtin_prefetch(zel_PktFrameMappedPointerGet(pkt));
+  ZelPktListIter* iter = la->iter;
+  zel_PktListIterMove(iter);
+  la->ahead = zel_PktListIterIsAtEnd(iter) ? nullptr : zel_PktListIterGetPkt(iter);
+  __builtin_prefetch(la->ahead);
 }
 
 inline void FWLookaheadStart(FWLookahead* la, ZelPktList* list, ZelPktListIter* iter) {
   zel_PktListIterStart(list, iter);
   la->iter = iter;
+  la->ahead = zel_PktListIterIsAtEnd(iter) ? nullptr : zel_PktListIterGetPkt(iter);
   for (uint32_t i = 0; i < kLookahead; i++) FWLookaheadStep(la);
 }
 

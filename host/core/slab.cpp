@@ -17,12 +17,30 @@
 namespace host {
 namespace {
 
+size_t BlockSize(size_t bytes) {
+  return ((bytes == 0 ? 1 : bytes) + kSlabAlign - 1) / kSlabAlign * kSlabAlign;
+}
+
+}  // namespace
+
+#ifdef SLC_HOST_ASAN
+
+void* SlabAlloc(size_t bytes) {
+  return ::operator new(BlockSize(bytes), std::align_val_t{kSlabAlign}, std::nothrow);
+}
+
+void SlabFree(void* block, size_t bytes) {
+  if (block != nullptr) ::operator delete(block, BlockSize(bytes), std::align_val_t{kSlabAlign});
+}
+
+#else
+
+namespace {
+
 constexpr size_t kChunk = size_t{2} << 20;
 constexpr size_t kClasses = kMaxSlabBlock / kSlabAlign;
 
-size_t RoundUp(size_t n, size_t to) { return (n + to - 1) / to * to; }
-
-// A chunk of `bytes` (a multiple of kChunk), aligned to kChunk so that it
+// A block of `bytes` (a multiple of kChunk), aligned to kChunk so that it
 // can be mapped with large pages.
 void* NewChunk(size_t bytes) {
   void* p = std::aligned_alloc(kChunk, bytes);
@@ -51,11 +69,8 @@ Slab& S() {
 }  // namespace
 
 void* SlabAlloc(size_t bytes) {
-  const size_t size = RoundUp(bytes == 0 ? 1 : bytes, kSlabAlign);
-#ifdef SLC_HOST_ASAN
-  return ::operator new(size, std::align_val_t{kSlabAlign}, std::nothrow);
-#else
-  if (size >= kChunk) return NewChunk(RoundUp(size, kChunk));
+  const size_t size = BlockSize(bytes);
+  if (size >= kChunk) return NewChunk((size + kChunk - 1) / kChunk * kChunk);
   if (size > kMaxSlabBlock) return std::aligned_alloc(kSlabAlign, size);
   Slab& s = S();
   const size_t units = size / kSlabAlign;
@@ -65,8 +80,7 @@ void* SlabAlloc(size_t bytes) {
     return b;
   }
   if (s.left < size) {
-    // The rest of the old chunk (less than one block of this size) stays
-    // unused.
+    // The rest of the old chunk (less than this block) stays unused.
     s.bump = static_cast<char*>(NewChunk(kChunk));
     if (s.bump == nullptr) {
       s.left = 0;
@@ -78,15 +92,11 @@ void* SlabAlloc(size_t bytes) {
   s.bump += size;
   s.left -= size;
   return b;
-#endif
 }
 
 void SlabFree(void* block, size_t bytes) {
   if (block == nullptr) return;
-  const size_t size = RoundUp(bytes == 0 ? 1 : bytes, kSlabAlign);
-#ifdef SLC_HOST_ASAN
-  ::operator delete(block, size, std::align_val_t{kSlabAlign});
-#else
+  const size_t size = BlockSize(bytes);
   if (size > kMaxSlabBlock) {
     std::free(block);
     return;
@@ -96,7 +106,8 @@ void SlabFree(void* block, size_t bytes) {
   std::lock_guard<std::mutex> g(s.mu);
   b->next = s.free[size / kSlabAlign];
   s.free[size / kSlabAlign] = b;
-#endif
 }
+
+#endif
 
 }  // namespace host
