@@ -372,6 +372,7 @@ inline void FWLookaheadStart(FWLookahead* la, ZelPktList* list, ZelPktListIter* 
   zel_PktListIterStart(list, iter);
   la->iter = iter;
   la->ahead = zel_PktListIterIsAtEnd(iter) ? nullptr : zel_PktListIterGetPkt(iter);
+  for (uint32_t i = 0; i < kLookahead; i++) la->queue[i] = nullptr;
   for (uint32_t i = 0; i < kLookahead; i++) FWLookaheadStep(la);
 }
 
