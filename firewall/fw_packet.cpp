@@ -340,6 +340,9 @@ static_assert((kRingSize & (kRingSize - 1)) == 0 && kParseAhead < kRingSize &&
 // longer sit in the per-core caches, and a walk that waits for each miss in
 // turn costs several times one that has them in flight.
 constexpr uint32_t kPipelineMinBuckets = 16384;
+// Tables with at least this many buckets (a quarter of a million exact
+// rules) also request buckets' second entries.
+constexpr uint32_t kNextEntryMinBuckets = 1u << 20;
 
 // The packets of a list in order, each handed out after its object and
 // the head of its frame were requested from memory. A list is linked
@@ -511,6 +514,38 @@ __attribute__((always_inline)) inline void FWDecide(FWWalk* walk, FWParsedPkt* c
   FWApplyAction(walk, pkt, action, entry, summary);
 }
 
+// The pipelined walk (see above). kNextEntry: also request the second
+// entry of buckets whose oldest will not match, for tables far beyond the
+// caches, where that entry would be a miss; in smaller tables it is
+// cached anyway and the extra step only costs instructions.
+template <bool kNextEntry>
+void FWWalkPipelined(FWWalk* walk, FWLookahead* la, FWTableView table, uint32_t fragOverride,
+                     bool early, bool haveGeneralRules) {
+  FWParsedPkt ring[kRingSize];
+  uint32_t parsed = 0;  // packets parsed so far
+  uint32_t done = 0;    // packets given their verdict
+  while (parsed < kParseAhead) {
+    ZelPkt* pkt = FWLookaheadTake(la);
+    if (pkt == nullptr) break;
+    FWParseInto<true>(pkt, &ring[parsed++ & (kRingSize - 1)], fragOverride, table);
+  }
+  // The first packets' entries: their buckets were requested together, so
+  // one wait covers them all.
+  for (uint32_t i = 0; i < kEntryAhead && i < parsed; i++) FWPrefetchEntry(&ring[i]);
+  while (done != parsed) {
+    if (ZelPkt* pkt = FWLookaheadTake(la)) {
+      FWParseInto<true>(pkt, &ring[parsed++ & (kRingSize - 1)], fragOverride, table);
+    }
+    if (parsed - done > kEntryAhead) {
+      FWPrefetchEntry(&ring[(done + kEntryAhead) & (kRingSize - 1)]);
+    }
+    if (kNextEntry && parsed - done > kNextEntryAhead) {
+      FWPrefetchNextEntry(&ring[(done + kNextEntryAhead) & (kRingSize - 1)]);
+    }
+    FWDecide(walk, &ring[done++ & (kRingSize - 1)], early, haveGeneralRules);
+  }
+}
+
 // The walk proper; configLock held shared, ruleHash not null. `ahead` is
 // storage for the iterator that runs ahead.
 void FWWalkList(FWWalk* walk, ZelPktList* list, ZelPktListIter* ahead) {
@@ -532,28 +567,10 @@ void FWWalkList(FWWalk* walk, ZelPktList* list, ZelPktListIter* ahead) {
     return;
   }
 
-  FWParsedPkt ring[kRingSize];
-  uint32_t parsed = 0;  // packets parsed so far
-  uint32_t done = 0;    // packets given their verdict
-  while (parsed < kParseAhead) {
-    ZelPkt* pkt = FWLookaheadTake(&la);
-    if (pkt == nullptr) break;
-    FWParseInto<true>(pkt, &ring[parsed++ & (kRingSize - 1)], fragOverride, table);
-  }
-  // The first packets' entries: their buckets were requested together, so
-  // one wait covers them all.
-  for (uint32_t i = 0; i < kEntryAhead && i < parsed; i++) FWPrefetchEntry(&ring[i]);
-  while (done != parsed) {
-    if (ZelPkt* pkt = FWLookaheadTake(&la)) {
-      FWParseInto<true>(pkt, &ring[parsed++ & (kRingSize - 1)], fragOverride, table);
-    }
-    if (parsed - done > kEntryAhead) {
-      FWPrefetchEntry(&ring[(done + kEntryAhead) & (kRingSize - 1)]);
-    }
-    if (parsed - done > kNextEntryAhead) {
-      FWPrefetchNextEntry(&ring[(done + kNextEntryAhead) & (kRingSize - 1)]);
-    }
-    FWDecide(walk, &ring[done++ & (kRingSize - 1)], early, haveGeneralRules);
+  if (ctx->ruleHash->numBuckets < kNextEntryMinBuckets) {
+    FWWalkPipelined<false>(walk, &la, table, fragOverride, early, haveGeneralRules);
+  } else {
+    FWWalkPipelined<true>(walk, &la, table, fragOverride, early, haveGeneralRules);
   }
 }
 

@@ -126,6 +126,7 @@ TEST_P(WalkShapes, LongMixedListGetsTheSameVerdictsInEitherShape) {
   b.Add(ExactTcp4("l2rewrite", 8, 8, std::string("rewrite=") + kRewriteMac));
   FWRule filler = rules::ParseRule(ExactTcp4("drop", 7, 7));
   for (uint32_t i = 0; i < GetParam(); i++) {
+    filler.ipSa[0] = static_cast<uint8_t>(11 + (i >> 16));
     filler.ipSa[1] = static_cast<uint8_t>(i >> 8);
     filler.ipSa[2] = static_cast<uint8_t>(i);
     b.Add(filler);
@@ -158,6 +159,8 @@ TEST_P(WalkShapes, LongMixedListGetsTheSameVerdictsInEitherShape) {
   EXPECT_EQ(GeneralPkts(0), 5u);
 }
 
-INSTANTIATE_TEST_SUITE_P(DirectAndPipelined, WalkShapes, ::testing::Values(0u, 20000u));
+// 140,000 rules: a table large enough that the walk also requests the
+// second entry of buckets.
+INSTANTIATE_TEST_SUITE_P(DirectAndPipelined, WalkShapes, ::testing::Values(0u, 20000u, 140000u));
 
 }  // namespace
