@@ -1,6 +1,7 @@
 #!/usr/bin/env python3
 """Draws ns per packet against rule count (log scales) from the JSON of
-classbench_bench, and prints the side-by-side table in Markdown.
+classbench_bench, and prints the side-by-side tables (general rules, exact
+hits) in Markdown.
 
 usage: bench/plot.py <classbench.json> <out.png>
 """
@@ -69,6 +70,17 @@ def main():
         ratio = f"{ours[n] / scalar[n]:.2f}x" if n in scalar else "-"
         print(f"| {n:,} | {cell(ours)} | {cell(scalar)} | {cell(best)} | {ratio} "
               f"| {cell(scan)} | {cell(mixed)} | {cell(mixedScan)} |")
+
+    exact = table.get("BM_ExactHits", {})
+    bulk = table.get("BM_PeerHashBulk", {})
+    if exact:
+        print()
+        print("| exact rules | this project | peer hash, bulk | ratio |")
+        print("|---|---|---|---|")
+        for n in sorted(exact):
+            peer = f"{bulk[n]:.1f} ns" if n in bulk else "-"
+            ratio = f"{exact[n] / bulk[n]:.2f}x" if n in bulk else "-"
+            print(f"| {n:,} | {exact[n]:.1f} ns | {peer} | {ratio} |")
 
 
 if __name__ == "__main__":
