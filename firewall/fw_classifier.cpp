@@ -336,8 +336,8 @@ ZelStatus BuildFromBoxes(Box* boxes, uint32_t count, FWClassifier** classifier) 
       root.width[d] = static_cast<uint8_t>(kDimBits[d]);
     }
     uint32_t roots[FW_CLS_TREES];
+    uint32_t numTrees = 0;
     for (uint32_t t = 0; t < FW_CLS_TREES; t++) {
-      roots[t] = FW_CLS_NO_TREE;
       if (!ok || members[t] == 0) continue;
       b.scratch.size = 0;
       for (uint32_t i = 0; i < count; i++) {
@@ -345,9 +345,10 @@ ZelStatus BuildFromBoxes(Box* boxes, uint32_t count, FWClassifier** classifier) 
       }
       // Each tree's share of the bound is that of its rules.
       const uint64_t budget = uint64_t{members[t]} * g_fwClassifierTuning.budgetPerRule;
-      roots[t] = b.nodes.size;
+      const uint32_t at = b.nodes.size;
+      roots[numTrees++] = at;
       ok = b.nodes.Push(FWClsNode{}) &&
-           b.Build(roots[t], 0, b.scratch.size, root, 0,
+           b.Build(at, 0, b.scratch.size, root, 0,
                    budget > members[t] ? budget : members[t]);
     }
     if (tree != nullptr) SLCGenericFree(tree);
@@ -368,7 +369,8 @@ ZelStatus BuildFromBoxes(Box* boxes, uint32_t count, FWClassifier** classifier) 
         if (residual.size != 0) {
           zel_Memcpy(rest, residual.data, static_cast<size_t>(residual.size) * 4);
         }
-        for (uint32_t t = 0; t < FW_CLS_TREES; t++) c->roots[t] = roots[t];
+        c->numTrees = numTrees;
+        for (uint32_t t = 0; t < numTrees; t++) c->roots[t] = roots[t];
         c->numRules = count;
         c->numNodes = b.nodes.size;
         c->numLeafSlots = b.leaves.size;

@@ -14,9 +14,10 @@
 //   4     IP protocol.
 // A field the rule does not compare, negates, or (ports of a rule that
 // compares the resource-pool tag) must not reject before the tag is read,
-// projects on the whole dimension. A packet lacking a field presents 0 for
-// it: every rule comparing the field requires its presence and misses
-// anyway, and every other rule spans the whole dimension.
+// projects on the whole dimension. A packet lacking a field may present
+// any value for it: every rule comparing the field requires its presence,
+// so its slot rejects the packet anyway, and every other rule spans the
+// whole dimension.
 //
 // Each rule goes to the tree of the dimension that separates it best (a
 // long address prefix, else a port, else a shorter address, else the
@@ -52,10 +53,10 @@ static_assert(sizeof(FWClsNode) == 12);
 inline constexpr uint8_t FW_CLS_LEAF = 0xff;
 
 inline constexpr uint32_t FW_CLS_TREES = FW_CLS_DIMS;
-inline constexpr uint32_t FW_CLS_NO_TREE = 0xffffffffu;
 
 struct FWClassifier {
-  uint32_t roots[FW_CLS_TREES];  // node number of each tree's root, or FW_CLS_NO_TREE
+  uint32_t numTrees;             // trees that hold rules
+  uint32_t roots[FW_CLS_TREES];  // the first numTrees: node number of each one's root
   uint32_t numRules;             // slots it was built for
   uint32_t numNodes;
   uint32_t numLeafSlots;
@@ -82,7 +83,7 @@ struct FWClassifierTuning {
   uint32_t smallRules;
 };
 extern FWClassifierTuning g_fwClassifierTuning;
-inline constexpr FWClassifierTuning kFWClassifierDefaults = {24, 16, 24, 256, 8, 4096};
+inline constexpr FWClassifierTuning kFWClassifierDefaults = {24, 16, 24, 256, 4, 4096};
 
 struct FWScanSlot;
 struct FWRuleEntry;
