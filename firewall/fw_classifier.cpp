@@ -369,6 +369,7 @@ ZelStatus BuildFromBoxes(Box* boxes, uint32_t count, FWClassifier** classifier) 
     uint32_t members[FW_CLS_TREES] = {};
     for (uint32_t i = 0; ok && i < count; i++) {
       tree[i] = static_cast<uint8_t>(TreeOf(boxes[i]));
+      if (tree[i] != FW_CLS_TREES && count <= t.oneTreeRules) tree[i] = 0;
       if (tree[i] == FW_CLS_TREES) {
         ok = residual.Push(i);
       } else {
