@@ -5,7 +5,8 @@
 // rule up to the match, so the per-rule cost is what counts:
 //   - the packet's fields are decoded once per scan into words (MACs
 //     zero-extended to 8 bytes, addresses both as stored and in numeric
-//     order), and packed into the four key words of the scan index;
+//     order), and packed into the four key words of the scan index (the
+//     two L2 words only when some slot compares them);
 //   - the scan walks the index (fw_index.h), a contiguous array of 64-byte
 //     slots in ruleset order, and tests each slot with four masked
 //     compares and one branch; a slot that rejects the packet is a rule
@@ -122,16 +123,16 @@ struct FWScan {
 void FWDecode(FWScan* s) {
   const FWPktSummary* summary = s->summary;
   FWPacketWords& p = s->p;
-  p = FWPacketWords{};
-  if (s->presence & FW_WC_DMAC) p.dMac = PacketMac(summary->dMac);
-  if (s->presence & FW_WC_SMAC) p.sMac = PacketMac(summary->sMac);
+  // Every field set once (no block clear: this runs for most packets that
+  // reach a rule's full test).
+  p.dMac = (s->presence & FW_WC_DMAC) ? PacketMac(summary->dMac) : 0;
+  p.sMac = (s->presence & FW_WC_SMAC) ? PacketMac(summary->sMac) : 0;
   p.ethType = FWLoad16(summary->ethType);
   p.vlan = FWLoad32(summary->vlan1QTag);
   p.ipProto = summary->ipProto;
-  if (s->v4 || s->v6) {
-    if (s->presence & FW_WC_IPSA) p.sa = PacketAddr(summary->ipSa, s->v4);
-    if (s->presence & FW_WC_IPDA) p.da = PacketAddr(summary->ipDa, s->v4);
-  }
+  const bool ip = s->v4 || s->v6;
+  p.sa = ip && (s->presence & FW_WC_IPSA) ? PacketAddr(summary->ipSa, s->v4) : FWAddr{};
+  p.da = ip && (s->presence & FW_WC_IPDA) ? PacketAddr(summary->ipDa, s->v4) : FWAddr{};
   p.sPortRaw = FWLoad16(summary->sPort);
   p.dPortRaw = FWLoad16(summary->dPort);
   p.sPort = FWNet16(summary->sPort);
