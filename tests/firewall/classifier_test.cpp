@@ -245,6 +245,30 @@ class ClassifierTest : public FirewallTest {
     FWFilterIoctlRequest(filter_, 7, msg.data(), msg.size());
   }
 
+  // Runs `attempt` with allocation 1, 2, ... failed until an attempt makes
+  // no allocation fail: each failed attempt must report the failure and
+  // leave the filter as it was; the last must succeed. Returns the
+  // attempts that failed.
+  template <typename Attempt>
+  uint64_t FailEachAllocation(const char* what, Attempt attempt) {
+    for (uint64_t n = 1;; n++) {
+      const Fingerprint before = Capture();
+      host::Faults::Fail("zel_HeapAllocWithRA", ZEL_NO_MEMORY, n);
+      const ZelStatus status = attempt();
+      const bool injected = host::Faults::Injected("zel_HeapAllocWithRA") > 0;
+      host::Faults::ClearAll();
+      if (!injected) {
+        EXPECT_EQ(status, ZEL_OK) << what;
+        return n - 1;
+      }
+      if (status != ZEL_FAILURE || !(Capture() == before)) {
+        ADD_FAILURE() << what << ": allocation " << n << " failed, status " << status
+                      << (Capture() == before ? "" : ", the filter changed");
+        return n;
+      }
+    }
+  }
+
   uint64_t checked_ = 0, hits_ = 0;
 };
 
@@ -409,21 +433,10 @@ TEST_F(ClassifierTest, AllocationFailureAnywhereInTheBuildChangesNothing) {
   ASSERT_EQ(Apply(first.Bytes(), true), ZEL_OK);
   const auto rs = next.Bytes();
   for (const bool replace : {true, false}) {
-    const Fingerprint before = Capture();
-    uint64_t failures = 0;
-    for (uint64_t n = 1;; n++) {
-      host::Faults::Fail("zel_HeapAllocWithRA", ZEL_NO_MEMORY, n);
-      const ZelStatus status = Apply(rs, replace);
-      const bool injected = host::Faults::Injected("zel_HeapAllocWithRA") > 0;
-      host::Faults::ClearAll();
-      if (!injected) {
-        EXPECT_EQ(status, ZEL_OK);
-        break;
-      }
-      failures++;
-      ASSERT_EQ(status, ZEL_FAILURE) << "allocation " << n;
-      ASSERT_TRUE(Capture() == before) << "allocation " << n << " changed the filter";
-    }
+    const uint64_t failures = FailEachAllocation(replace ? "replace" : "add", [&] {
+      return Apply(rs, replace);
+    });
+    if (HasFailure()) return;
     // Every rule record, the index, and the classifier's own blocks
     // (growing arrays included) were each failed once.
     EXPECT_GT(failures, 150u + 5u) << (replace ? "replace" : "add");
@@ -472,22 +485,11 @@ TEST_F(ClassifierTest, ReplacementBuiltBeforeTheHoldUnderAllocationFailure) {
   for (const Channel& ch : channels) {
     ASSERT_EQ(Apply(first.Bytes(), true, ch.fromIoctl), ZEL_OK) << ch.name;
     const uint64_t heapBlocks = Capture().heapBlocks;
-    uint64_t failures = 0;
-    for (uint64_t n = 1;; n++) {
-      const Fingerprint before = Capture();
+    const uint64_t failures = FailEachAllocation(ch.name, [&] {
       std::vector<uint8_t> copy = next.Bytes();
-      host::Faults::Fail("zel_HeapAllocWithRA", ZEL_NO_MEMORY, n);
-      const ZelStatus status = ch.replace(filter_, copy);
-      const bool injected = host::Faults::Injected("zel_HeapAllocWithRA") > 0;
-      host::Faults::ClearAll();
-      if (!injected) {
-        ASSERT_EQ(status, ZEL_OK) << ch.name;
-        break;
-      }
-      failures++;
-      ASSERT_EQ(status, ZEL_FAILURE) << ch.name << " allocation " << n;
-      ASSERT_TRUE(Capture() == before) << ch.name << " allocation " << n << " changed the filter";
-    }
+      return ch.replace(filter_, copy);
+    });
+    if (HasFailure()) return;
     // Every record, the table, the index and the classifier's blocks.
     EXPECT_GT(failures, 80u + 3u) << ch.name;
     ASSERT_NE(ctx_->scanIndex->classifier, nullptr);
