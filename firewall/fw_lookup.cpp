@@ -309,6 +309,14 @@ FWRuleEntry* FWFindKeyed(const FWScanIndex* index, FWScan& s) {
     // of the whole scan, reached through the same full tests. A slot is
     // in one list only.
     const FWClsKey key = ClassifierKey(s, k);
+    if (cls->numTrees == 1 && cls->numResidual == 0) {  // one leaf: nothing to merge
+      uint32_t n;
+      const uint32_t* leaf = FWClassifierLeaf(cls, cls->roots[0], key, &n);
+      for (const uint32_t* end = leaf + n; leaf != end; leaf++) {
+        if (miss(slots[*leaf]) == 0 && accept(*leaf)) return entries[*leaf];
+      }
+      return nullptr;
+    }
     const uint32_t* list[FW_CLS_TREES + 1];
     const uint32_t* end[FW_CLS_TREES + 1];
     uint32_t lists = 0;

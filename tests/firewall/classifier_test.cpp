@@ -273,7 +273,8 @@ class ClassifierTest : public FirewallTest {
 };
 
 TEST_F(ClassifierTest, SameRuleAsTheOrderedScanForEveryPacket) {
-  uint64_t id = 1, built = 0, residual = 0, prepared = 0, oneTree = 0, noL2 = 0;
+  uint64_t id = 1, built = 0, residual = 0, prepared = 0, oneTree = 0, oneLeaf = 0,
+           noL2 = 0;
   for (uint32_t iter = 0; iter < 400; iter++) {
     Gen gen(0xc1a55000u + iter);
     // Leaves of 1 to 8 rules, and now and then a budget that stops the
@@ -309,6 +310,8 @@ TEST_F(ClassifierTest, SameRuleAsTheOrderedScanForEveryPacket) {
     built++;
     residual += ctx_->scanIndex->classifier->numResidual;
     oneTree += ctx_->scanIndex->classifier->numTrees == 1;
+    oneLeaf += ctx_->scanIndex->classifier->numTrees == 1 &&
+               ctx_->scanIndex->classifier->numResidual == 0;
     noL2 += !ctx_->scanIndex->l2Words;
     ExpectSameAsModel(gen, model, iter, 300);
     if (HasFailure()) return;
@@ -337,6 +340,7 @@ TEST_F(ClassifierTest, SameRuleAsTheOrderedScanForEveryPacket) {
   EXPECT_GT(prepared, 100u);
   EXPECT_GT(residual, 0u);
   EXPECT_GT(oneTree, 100u);
+  EXPECT_GT(oneLeaf, 5u);  // a lookup with a single leaf to walk (the sweep below: always)
   EXPECT_GT(noL2, 50u);
   EXPECT_GT(hits_, checked_ / 3);
   RecordProperty("hits", std::to_string(hits_) + "/" + std::to_string(checked_));
@@ -372,7 +376,10 @@ TEST_F(ClassifierTest, EveryDestinationPortAgainstTheOrderedScan) {
     }
     const auto rs = b.Bytes();
     ASSERT_EQ(Apply(rs, true), ZEL_OK);
-    ASSERT_NE(ctx_->scanIndex->classifier, nullptr);
+    const FWClassifier* cls = ctx_->scanIndex->classifier;
+    ASSERT_NE(cls, nullptr);
+    ASSERT_EQ(cls->numTrees, 1u);  // every rule in the port tree: one leaf per lookup
+    ASSERT_EQ(cls->numResidual, 0u);
     FwModel model;
     model.Apply(rs, true);
     ModelPacket p;
