@@ -520,7 +520,7 @@ void BM_ClassBenchApply(benchmark::State& state) {
   state.counters["classifier_bytes_per_rule"] =
       b.ClassifierBytes() / static_cast<double>(state.range(0));
 }
-BENCHMARK(BM_ClassBenchApply)->Arg(10000)->Arg(100000)->Iterations(3)->Unit(benchmark::kMillisecond);
+BENCHMARK(BM_ClassBenchApply)->Arg(1000)->Arg(10000)->Arg(100000)->Iterations(3)->Unit(benchmark::kMillisecond);
 
 
 // Exact rules: flow i is 10.x.y.z (i) -> 192.168.0.1, TCP 1234 -> 80.

@@ -16,6 +16,8 @@ constexpr uint32_t kMaxCutBits = 8;
 // A node may copy its rules into its children at most this many times over
 // (children counted too), so that one cut never multiplies memory.
 constexpr uint64_t kSpaceFactor = 4;
+// Lists longer than this choose their cut on a sample of this many rules.
+constexpr uint32_t kSampleRules = 1024;
 // A node costs three leaf entries (12 bytes against 4).
 constexpr uint64_t kNodeCost = sizeof(FWClsNode) / sizeof(uint32_t);
 
@@ -153,6 +155,8 @@ struct Builder {
   HeapArray<uint32_t> leaves;
   HeapArray<uint32_t> scratch;  // rule lists of the nodes being built, as a stack
   HeapArray<uint32_t> counts;   // per child, 2^kMaxCutBits + 1
+  HeapArray<uint32_t> spans;    // two per rule of the node being cut
+  HeapArray<uint32_t> offsets;  // where each child's list starts, per node being built
 
   [[nodiscard]] bool MakeLeaf(uint32_t node, uint32_t off, uint32_t count) {
     if (!leaves.Reserve(uint64_t{leaves.size} + count)) return false;
@@ -177,16 +181,31 @@ struct Builder {
     *last = static_cast<uint32_t>((hi - reg.base[d]) >> shift);
   }
 
-  // The largest child and the copies made by cutting d into 2^bits.
-  void Evaluate(uint32_t off, uint32_t count, const Region& reg, uint32_t d, uint32_t bits,
-                uint32_t* largest, uint64_t* copies) {
+  // The children every stride-th rule of the list meets when dimension d
+  // of `reg` is cut into 2^bits: pairs (first, last) in spans. Returns the
+  // rules sampled.
+  uint32_t Spans(uint32_t off, uint32_t count, uint32_t stride, const Region& reg, uint32_t d,
+                 uint32_t bits) {
+    uint32_t sampled = 0;
+    for (uint32_t k = 0; k < count; k += stride, sampled++) {
+      ChildSpan(scratch.data[off + k], reg, d, bits, &spans.data[2 * sampled],
+                &spans.data[2 * sampled + 1]);
+    }
+    return sampled;
+  }
+
+  // The largest child and the copies of the cut into 2^bits children whose
+  // spans, `shift` bits finer, Spans left, scaled from `sampled` rules to
+  // `count`.
+  void Evaluate(uint32_t sampled, uint32_t count, uint32_t bits, uint32_t shift,
+                uint64_t* largest, uint64_t* copies) {
     const uint32_t children = 1u << bits;
     uint32_t* c = counts.data;
     zel_Memset(c, 0, (children + 1) * sizeof(uint32_t));
     uint64_t total = 0;
-    for (uint32_t k = 0; k < count; k++) {
-      uint32_t first, last;
-      ChildSpan(scratch.data[off + k], reg, d, bits, &first, &last);
+    const uint32_t* span = spans.data;
+    for (uint32_t k = 0; k < sampled; k++) {
+      const uint32_t first = span[2 * k] >> shift, last = span[2 * k + 1] >> shift;
       c[first]++;
       c[last + 1]--;
       total += last - first + 1;
@@ -196,16 +215,17 @@ struct Builder {
       running += c[j];
       if (running > most) most = running;
     }
-    *largest = most;
-    *copies = total;
+    *largest = uint64_t{most} * count / sampled;
+    *copies = total * count / sampled;
   }
 
   // Builds node `node` for the rules scratch[off, off + count) in region
   // `reg`, spending at most `budget` leaf entries (nodes at kNodeCost) on
   // the subtree; at least `count`, what a leaf takes. A cut keeps enough
   // for every child to be a leaf and shares the rest in proportion to the
-  // children's rules, so the bound holds however the tree grows. False
-  // when memory ran out.
+  // children's rules, so the bound holds however the tree grows. The
+  // children's lists go on top of the scratch stack and are gone when it
+  // returns. False when memory ran out.
   [[nodiscard]] bool Build(uint32_t node, uint32_t off, uint32_t count, const Region& reg,
                            uint32_t depth, uint64_t budget) {
     const FWClassifierTuning& t = g_fwClassifierTuning;
@@ -213,17 +233,22 @@ struct Builder {
       return MakeLeaf(node, off, count);
     }
     // The cut that leaves the smallest largest child within the space
-    // factor; fewer copies break ties. Only a cut whose every child holds
-    // fewer rules than this node is taken (sibling subtrees are shared on
-    // that ground, below).
-    uint32_t bestDim = FW_CLS_DIMS, bestBits = 0, bestLargest = count;
-    uint64_t bestCopies = 0;
+    // factor; fewer copies break ties. Large lists are judged on a sample;
+    // the cut taken is then counted exactly.
+    const uint32_t stride = count > kSampleRules ? count / kSampleRules : 1;
+    uint32_t bestDim = FW_CLS_DIMS, bestBits = 0;
+    uint64_t bestLargest = count, bestCopies = 0;
+    // A cut into more than three children per rule breaks the space
+    // factor (every rule is copied at least once): no finer spans needed.
+    const uint32_t countBits = 33 - static_cast<uint32_t>(__builtin_clz(count));
+    const uint32_t bitsCap = countBits < kMaxCutBits ? countBits : kMaxCutBits;
     for (uint32_t d = 0; d < FW_CLS_DIMS; d++) {
-      const uint32_t maxBits = reg.width[d] < kMaxCutBits ? reg.width[d] : kMaxCutBits;
+      const uint32_t maxBits = reg.width[d] < bitsCap ? reg.width[d] : bitsCap;
+      if (maxBits == 0) continue;
+      const uint32_t sampled = Spans(off, count, stride, reg, d, maxBits);
       for (uint32_t bits = 1; bits <= maxBits; bits++) {
-        uint32_t largest;
-        uint64_t copies;
-        Evaluate(off, count, reg, d, bits, &largest, &copies);
+        uint64_t largest, copies;
+        Evaluate(sampled, count, bits, maxBits - bits, &largest, &copies);
         if (copies + (1u << bits) > kSpaceFactor * count && bits > 1) break;
         if (largest < bestLargest || (largest == bestLargest && bestDim != FW_CLS_DIMS &&
                                       copies < bestCopies)) {
@@ -234,16 +259,56 @@ struct Builder {
         }
       }
     }
+    if (bestDim == FW_CLS_DIMS) return MakeLeaf(node, off, count);
+    const uint32_t d = bestDim;
     const uint32_t children = 1u << bestBits;
-    if (bestDim == FW_CLS_DIMS || children * kNodeCost + bestCopies > budget) {
+
+    // Each child's rules, counted exactly: the starts of the children's
+    // lists (relative to `fill`) go on the offsets stack.
+    const uint32_t at = offsets.size;
+    if (!offsets.Reserve(uint64_t{at} + children + 1)) return false;
+    uint32_t* c = counts.data;
+    zel_Memset(c, 0, (children + 1) * sizeof(uint32_t));
+    uint64_t copies = 0;
+    for (uint32_t k = 0; k < count; k++) {
+      uint32_t first, last;
+      ChildSpan(scratch.data[off + k], reg, d, bestBits, &first, &last);
+      c[first]++;
+      c[last + 1]--;
+      copies += last - first + 1;
+    }
+    uint32_t running = 0, largest = 0, start = 0;
+    for (uint32_t j = 0; j < children; j++) {
+      running += c[j];
+      if (running > largest) largest = running;
+      offsets.data[at + j] = start;
+      c[j] = start;  // from here on, where child j's next rule goes
+      start += running;
+    }
+    offsets.data[at + children] = start;
+    // Only a cut whose every child holds fewer rules than this node is
+    // taken (sibling subtrees are shared on that ground, below), within
+    // the space factor and the budget.
+    if (largest >= count || (copies + children > kSpaceFactor * count && bestBits > 1) ||
+        children * kNodeCost + copies > budget) {
       return MakeLeaf(node, off, count);
     }
     const uint64_t share = budget - children * kNodeCost;
+    const uint32_t fill = scratch.size;
+    if (!scratch.Reserve(uint64_t{fill} + copies) || !nodes.Reserve(uint64_t{nodes.size} + children)) {
+      return false;
+    }
+    offsets.size = at + children + 1;
+    scratch.size = fill + static_cast<uint32_t>(copies);
+    for (uint32_t k = 0; k < count; k++) {
+      const uint32_t i = scratch.data[off + k];
+      uint32_t first, last;
+      ChildSpan(i, reg, d, bestBits, &first, &last);
+      for (uint32_t j = first; j <= last; j++) scratch.data[fill + c[j]++] = i;
+    }
 
-    if (!nodes.Reserve(uint64_t{nodes.size} + children)) return false;
     const uint32_t childBase = nodes.size;
     nodes.size += children;
-    const uint32_t d = bestDim;
     const uint32_t shift = reg.width[d] - bestBits;
     nodes.data[node] = FWClsNode{childBase, 0, static_cast<uint8_t>(d),
                                  static_cast<uint8_t>(shift),
@@ -251,55 +316,34 @@ struct Builder {
 
     Region sub = reg;
     sub.width[d] = static_cast<uint8_t>(shift);
-    // The previous sibling's list stays on the stack so that an equal list
-    // can share its subtree.
-    uint32_t prevOff = 0, prevCount = 0;
-    bool havePrev = false;
-    for (uint32_t c = 0; c < children; c++) {
-      sub.base[d] = reg.base[d] + static_cast<uint32_t>(uint64_t{c} << shift);
-      const uint64_t subLo = sub.base[d], subHi = RegionHigh(sub, d);
-      const uint32_t curOff = scratch.size;
-      if (!scratch.Reserve(uint64_t{curOff} + count)) return false;
-      for (uint32_t k = 0; k < count; k++) {
-        const uint32_t i = scratch.data[off + k];
-        if (boxes[i].lo[d] <= subHi && boxes[i].hi[d] >= subLo) {
-          scratch.data[scratch.size++] = i;
-        }
-      }
-      const uint32_t curCount = scratch.size - curOff;
+    for (uint32_t j = 0; j < children; j++) {
+      sub.base[d] = reg.base[d] + static_cast<uint32_t>(uint64_t{j} << shift);
+      const uint32_t curOff = fill + offsets.data[at + j];
+      const uint32_t curCount = offsets.data[at + j + 1] - offsets.data[at + j];
       // Siblings with the same rules get one subtree. It serves both
       // because it never cuts d again: every rule of the list meets both
       // siblings, so contains the last value of the previous one, and a
       // cut of d anywhere below would leave one child with all the rules,
       // which a cut must improve on. Cuts of other dimensions see the
       // same projections in both siblings.
-      if (havePrev && prevCount == curCount &&
-          (curCount == 0 ||
-           zel_Memcmp(scratch.data + prevOff, scratch.data + curOff, curCount * 4) == 0)) {
-        nodes.data[childBase + c] = nodes.data[childBase + c - 1];
-        scratch.size = curOff;
-        continue;
+      if (j != 0) {
+        const uint32_t prevOff = fill + offsets.data[at + j - 1];
+        const uint32_t prevCount = offsets.data[at + j] - offsets.data[at + j - 1];
+        if (prevCount == curCount &&
+            (curCount == 0 ||
+             zel_Memcmp(scratch.data + prevOff, scratch.data + curOff, curCount * 4) == 0)) {
+          nodes.data[childBase + j] = nodes.data[childBase + j - 1];
+          continue;
+        }
       }
-      const uint64_t childBudget =
-          bestCopies == 0 ? 0 : share * curCount / bestCopies;
-      if (!Build(childBase + c, curOff, curCount, sub, depth + 1,
+      const uint64_t childBudget = copies == 0 ? 0 : share * curCount / copies;
+      if (!Build(childBase + j, curOff, curCount, sub, depth + 1,
                  childBudget > curCount ? childBudget : curCount)) {
         return false;
       }
-      if (havePrev) {
-        // Drop the previous list; the current one becomes previous.
-        // Forward copy to a lower address: safe although the lists may overlap.
-        for (uint32_t k = 0; k < curCount; k++) {
-          scratch.data[prevOff + k] = scratch.data[curOff + k];
-        }
-        scratch.size = prevOff + curCount;
-      } else {
-        prevOff = curOff;
-        havePrev = true;
-      }
-      prevCount = curCount;
     }
-    scratch.size = off + count;
+    offsets.size = at;
+    scratch.size = fill;
     return true;
   }
 };
@@ -320,10 +364,12 @@ ZelStatus BuildFromBoxes(Box* boxes, uint32_t count, FWClassifier** classifier) 
     HeapArray<uint32_t> residual;
     auto* tree = static_cast<uint8_t*>(SLCGenericAlloc(count));
     bool ok = tree != nullptr && b.counts.Reserve((1u << kMaxCutBits) + 1) &&
+              b.spans.Reserve(2 * uint64_t{count}) &&
               b.scratch.Reserve(count);
     uint32_t members[FW_CLS_TREES] = {};
     for (uint32_t i = 0; ok && i < count; i++) {
       tree[i] = static_cast<uint8_t>(TreeOf(boxes[i]));
+      if (tree[i] != FW_CLS_TREES && count <= t.oneTreeRules) tree[i] = 0;
       if (tree[i] == FW_CLS_TREES) {
         ok = residual.Push(i);
       } else {
@@ -336,8 +382,8 @@ ZelStatus BuildFromBoxes(Box* boxes, uint32_t count, FWClassifier** classifier) 
       root.width[d] = static_cast<uint8_t>(kDimBits[d]);
     }
     uint32_t roots[FW_CLS_TREES];
+    uint32_t numTrees = 0;
     for (uint32_t t = 0; t < FW_CLS_TREES; t++) {
-      roots[t] = FW_CLS_NO_TREE;
       if (!ok || members[t] == 0) continue;
       b.scratch.size = 0;
       for (uint32_t i = 0; i < count; i++) {
@@ -345,9 +391,10 @@ ZelStatus BuildFromBoxes(Box* boxes, uint32_t count, FWClassifier** classifier) 
       }
       // Each tree's share of the bound is that of its rules.
       const uint64_t budget = uint64_t{members[t]} * g_fwClassifierTuning.budgetPerRule;
-      roots[t] = b.nodes.size;
+      const uint32_t at = b.nodes.size;
+      roots[numTrees++] = at;
       ok = b.nodes.Push(FWClsNode{}) &&
-           b.Build(roots[t], 0, b.scratch.size, root, 0,
+           b.Build(at, 0, b.scratch.size, root, 0,
                    budget > members[t] ? budget : members[t]);
     }
     if (tree != nullptr) SLCGenericFree(tree);
@@ -368,7 +415,8 @@ ZelStatus BuildFromBoxes(Box* boxes, uint32_t count, FWClassifier** classifier) 
         if (residual.size != 0) {
           zel_Memcpy(rest, residual.data, static_cast<size_t>(residual.size) * 4);
         }
-        for (uint32_t t = 0; t < FW_CLS_TREES; t++) c->roots[t] = roots[t];
+        c->numTrees = numTrees;
+        for (uint32_t t = 0; t < numTrees; t++) c->roots[t] = roots[t];
         c->numRules = count;
         c->numNodes = b.nodes.size;
         c->numLeafSlots = b.leaves.size;

@@ -14,14 +14,16 @@
 //   4     IP protocol.
 // A field the rule does not compare, negates, or (ports of a rule that
 // compares the resource-pool tag) must not reject before the tag is read,
-// projects on the whole dimension. A packet lacking a field presents 0 for
-// it: every rule comparing the field requires its presence and misses
-// anyway, and every other rule spans the whole dimension.
+// projects on the whole dimension. A packet lacking a field may present
+// any value for it: every rule comparing the field requires its presence,
+// so its slot rejects the packet anyway, and every other rule spans the
+// whole dimension.
 //
-// Each rule goes to the tree of the dimension that separates it best (a
-// long address prefix, else a port, else a shorter address, else the
-// protocol), so that rules wide on one address do not get copied across
-// every cut of a tree built on it. A node cuts an aligned power-of-two
+// In large rulesets each rule goes to the tree of the dimension that
+// separates it best (a long address prefix, else a port, else a shorter
+// address, else the protocol), so that rules wide on one address do not
+// get copied across every cut of a tree built on it; small ones have one
+// tree (FWClassifierTuning). A node cuts an aligned power-of-two
 // block of one dimension into 2^bits equal children; a rule goes to every
 // child its projection meets, in ruleset order, so a leaf lists slot
 // numbers in ascending order. Rules wide on every dimension would be
@@ -52,10 +54,10 @@ static_assert(sizeof(FWClsNode) == 12);
 inline constexpr uint8_t FW_CLS_LEAF = 0xff;
 
 inline constexpr uint32_t FW_CLS_TREES = FW_CLS_DIMS;
-inline constexpr uint32_t FW_CLS_NO_TREE = 0xffffffffu;
 
 struct FWClassifier {
-  uint32_t roots[FW_CLS_TREES];  // node number of each tree's root, or FW_CLS_NO_TREE
+  uint32_t numTrees;             // trees that hold rules
+  uint32_t roots[FW_CLS_TREES];  // the first numTrees: node number of each one's root
   uint32_t numRules;             // slots it was built for
   uint32_t numNodes;
   uint32_t numLeafSlots;
@@ -71,8 +73,11 @@ struct FWClassifier {
 // for rulesets of at most smallRules rules: finer leaves test fewer
 // candidates per packet, and only small rulesets build them fast enough);
 // the tree holds at most budgetPerRule 4-byte words (leaf entries; a node
-// takes three) per rule. Tests lower them to exercise deep trees on small
-// rulesets.
+// takes three) per rule. Rulesets of at most oneTreeRules rules put every
+// rule the trees take in one tree: a lookup then descends once and merges
+// nothing (but the residual list), and the copies of rules wide on the
+// dimension cut stay affordable. Tests lower them to exercise deep trees
+// on small rulesets.
 struct FWClassifierTuning {
   uint32_t minRules;
   uint32_t leafSize;
@@ -80,9 +85,10 @@ struct FWClassifierTuning {
   uint32_t budgetPerRule;
   uint32_t smallLeafSize;
   uint32_t smallRules;
+  uint32_t oneTreeRules;
 };
 extern FWClassifierTuning g_fwClassifierTuning;
-inline constexpr FWClassifierTuning kFWClassifierDefaults = {24, 16, 24, 256, 8, 4096};
+inline constexpr FWClassifierTuning kFWClassifierDefaults = {24, 16, 24, 256, 4, 4096, 4096};
 
 struct FWScanSlot;
 struct FWRuleEntry;

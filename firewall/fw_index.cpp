@@ -200,12 +200,14 @@ ZelStatus FWScanIndexBuild(const ListLinks* ruleList, FWScanIndex** index,
   idx->capacity = static_cast<uint32_t>(count);
 
   uint32_t i = 0;
+  idx->l2Words = false;
   for (const ListLinks* list : lists) {
     if (list == nullptr) continue;
     for (ListLinks* l = list->prev; l != list; l = l->prev, i++) {
       FWRuleEntry* entry = FWEntryFromLink(l);
       SlotFromRule(entry->rule, &idx->slots[i]);
       idx->entries[i] = entry;
+      idx->l2Words |= (idx->slots[i].mask[2] | idx->slots[i].mask[3]) != 0;
     }
   }
   idx->count = i;

@@ -41,6 +41,7 @@ struct FWScanIndex {
   FWScanSlot* slots;       // inside this block, 64-byte aligned
   FWRuleEntry** entries;   // inside this block; entries[i] belongs to slots[i]
   FWClassifier* classifier;  // separate block, or null: scan every slot
+  bool l2Words;            // some slot masks key word 2 or 3; else the scan skips both
 };
 
 // Key word 0: ports and protocol as stored, presence bits 0-9, the family

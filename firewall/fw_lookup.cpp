@@ -5,7 +5,8 @@
 // rule up to the match, so the per-rule cost is what counts:
 //   - the packet's fields are decoded once per scan into words (MACs
 //     zero-extended to 8 bytes, addresses both as stored and in numeric
-//     order), and packed into the four key words of the scan index;
+//     order), and packed into the four key words of the scan index (the
+//     two L2 words only when some slot compares them);
 //   - the scan walks the index (fw_index.h), a contiguous array of 64-byte
 //     slots in ruleset order, and tests each slot with four masked
 //     compares and one branch; a slot that rejects the packet is a rule
@@ -122,16 +123,16 @@ struct FWScan {
 void FWDecode(FWScan* s) {
   const FWPktSummary* summary = s->summary;
   FWPacketWords& p = s->p;
-  p = FWPacketWords{};
-  if (s->presence & FW_WC_DMAC) p.dMac = PacketMac(summary->dMac);
-  if (s->presence & FW_WC_SMAC) p.sMac = PacketMac(summary->sMac);
+  // Every field set once (no block clear: this runs for most packets that
+  // reach a rule's full test).
+  p.dMac = (s->presence & FW_WC_DMAC) ? PacketMac(summary->dMac) : 0;
+  p.sMac = (s->presence & FW_WC_SMAC) ? PacketMac(summary->sMac) : 0;
   p.ethType = FWLoad16(summary->ethType);
   p.vlan = FWLoad32(summary->vlan1QTag);
   p.ipProto = summary->ipProto;
-  if (s->v4 || s->v6) {
-    if (s->presence & FW_WC_IPSA) p.sa = PacketAddr(summary->ipSa, s->v4);
-    if (s->presence & FW_WC_IPDA) p.da = PacketAddr(summary->ipDa, s->v4);
-  }
+  const bool ip = s->v4 || s->v6;
+  p.sa = ip && (s->presence & FW_WC_IPSA) ? PacketAddr(summary->ipSa, s->v4) : FWAddr{};
+  p.da = ip && (s->presence & FW_WC_IPDA) ? PacketAddr(summary->ipDa, s->v4) : FWAddr{};
   p.sPortRaw = FWLoad16(summary->sPort);
   p.dPortRaw = FWLoad16(summary->dPort);
   p.sPort = FWNet16(summary->sPort);
@@ -236,6 +237,9 @@ inline uint64_t KeyAddress(const uint8_t* a, bool v4) {
   return v4 ? FWLoad32(a) : FWFold32(FWLoad64(a), FWLoad64(a + 8));
 }
 
+// Words 2 and 3 (MACs, ethertype, 802.1Q tag) only with kL2: an index
+// none of whose slots compares them leaves them 0.
+template <bool kL2>
 inline FWPacketKey PacketKey(const FWScan& s) {
   const FWPktSummary* summary = s.summary;
   const uint32_t presence = s.presence;
@@ -251,25 +255,131 @@ inline FWPacketKey PacketKey(const FWScan& s) {
     if (presence & FW_WC_IPSA) k.k1 = KeyAddress(summary->ipSa, s.v4);
     if (presence & FW_WC_IPDA) k.k1 |= KeyAddress(summary->ipDa, s.v4) << 32;
   }
-  k.k2 = static_cast<uint64_t>(FWLoad16(summary->ethType)) << FW_KEY_HIGH16_SHIFT;
-  if (presence & FW_WC_DMAC) k.k2 |= PacketMac(summary->dMac);
-  k.k3 = FWFold16(FWLoad32(summary->vlan1QTag)) << FW_KEY_HIGH16_SHIFT;
-  if (presence & FW_WC_SMAC) k.k3 |= PacketMac(summary->sMac);
+  k.k2 = k.k3 = 0;
+  if (kL2) {
+    k.k2 = static_cast<uint64_t>(FWLoad16(summary->ethType)) << FW_KEY_HIGH16_SHIFT;
+    if (presence & FW_WC_DMAC) k.k2 |= PacketMac(summary->dMac);
+    k.k3 = FWFold16(FWLoad32(summary->vlan1QTag)) << FW_KEY_HIGH16_SHIFT;
+    if (presence & FW_WC_SMAC) k.k3 |= PacketMac(summary->sMac);
+  }
   return k;
 }
 
-// The packet's value on each classifier dimension (fw_classifier.h); 0 for
-// a field the packet lacks.
-inline FWClsKey ClassifierKey(const FWScan& s) {
-  const FWPktSummary* summary = s.summary;
-  const uint32_t presence = s.presence;
+// The packet's value on each classifier dimension (fw_classifier.h), from
+// its key words where they hold it as stored: IPv4 addresses (0 when
+// absent), ports and protocol (whatever the summary holds when absent).
+// IPv6 addresses are folded there, so their leading word is loaded again.
+inline FWClsKey ClassifierKey(const FWScan& s, const FWPacketKey& k) {
   FWClsKey key;
-  key.v[0] = (presence & FW_WC_IPSA) ? FWNet32(summary->ipSa) : 0;
-  key.v[1] = (presence & FW_WC_IPDA) ? FWNet32(summary->ipDa) : 0;
-  key.v[2] = (presence & FW_WC_SPORT) ? FWNet16(summary->sPort) : 0;
-  key.v[3] = (presence & FW_WC_DPORT) ? FWNet16(summary->dPort) : 0;
-  key.v[4] = (presence & FW_WC_IPPROTO) ? summary->ipProto : 0;
+  if (s.v6) {
+    key.v[0] = (s.presence & FW_WC_IPSA) ? FWNet32(s.summary->ipSa) : 0;
+    key.v[1] = (s.presence & FW_WC_IPDA) ? FWNet32(s.summary->ipDa) : 0;
+  } else {
+    key.v[0] = __builtin_bswap32(static_cast<uint32_t>(k.k1));
+    key.v[1] = __builtin_bswap32(static_cast<uint32_t>(k.k1 >> 32));
+  }
+  key.v[2] = __builtin_bswap16(static_cast<uint16_t>(k.k0 >> FW_KEY0_SPORT_SHIFT));
+  key.v[3] = __builtin_bswap16(static_cast<uint16_t>(k.k0 >> FW_KEY0_DPORT_SHIFT));
+  key.v[4] = static_cast<uint8_t>(k.k0 >> FW_KEY0_PROTO_SHIFT);
   return key;
+}
+
+// The keyed lookup: slots tested by their masked words (and the full test
+// when a slot says so), through the classifier when there is one.
+template <bool kL2>
+FWRuleEntry* FWFindKeyed(const FWScanIndex* index, FWScan& s) {
+  const uint32_t count = index->count;
+  FWRuleEntry* const* entries = index->entries;
+  const FWPacketKey k = PacketKey<kL2>(s);
+  const FWScanSlot* const slots = index->slots;
+  auto miss = [&k](const FWScanSlot& slot) {
+    uint64_t m = ((k.k0 ^ slot.value[0]) & slot.mask[0]) | ((k.k1 ^ slot.value[1]) & slot.mask[1]);
+    if (kL2) {
+      m |= ((k.k2 ^ slot.value[2]) & slot.mask[2]) | ((k.k3 ^ slot.value[3]) & slot.mask[3]);
+    }
+    return m;
+  };
+  auto accept = [&](uint32_t i) {
+    return (slots[i].value[0] & FW_KEY0_EXACT) || FWRuleMatches(entries[i]->rule, &s);
+  };
+
+  if (const FWClassifier* cls = index->classifier; cls != nullptr) {
+    // The leaf of every tree and the residual list, merged in ascending
+    // slot order: the first slot that passes its test is the first match
+    // of the whole scan, reached through the same full tests. A slot is
+    // in one list only.
+    const FWClsKey key = ClassifierKey(s, k);
+    if (cls->numTrees == 1 && cls->numResidual == 0) {  // one leaf: nothing to merge
+      uint32_t n;
+      const uint32_t* leaf = FWClassifierLeaf(cls, cls->roots[0], key, &n);
+      for (const uint32_t* end = leaf + n; leaf != end; leaf++) {
+        if (miss(slots[*leaf]) == 0 && accept(*leaf)) return entries[*leaf];
+      }
+      return nullptr;
+    }
+    const uint32_t* list[FW_CLS_TREES + 1];
+    const uint32_t* end[FW_CLS_TREES + 1];
+    uint32_t lists = 0;
+    for (uint32_t t = 0; t < cls->numTrees; t++) {
+      uint32_t n;
+      const uint32_t* leaf = FWClassifierLeaf(cls, cls->roots[t], key, &n);
+      list[lists] = leaf;
+      end[lists] = leaf + n;
+      lists += n != 0;
+    }
+    if (cls->numResidual != 0) {
+      list[lists] = cls->residual;
+      end[lists++] = cls->residual + cls->numResidual;
+    }
+    // More than two lists: the smallest head first, until two are left.
+    while (lists > 2) {
+      uint32_t best = 0;
+      for (uint32_t j = 1; j < lists; j++) {
+        if (*list[j] < *list[best]) best = j;
+      }
+      const uint32_t i = *list[best]++;
+      if (list[best] == end[best]) {  // exhausted: the last list takes its place
+        lists--;
+        list[best] = list[lists];
+        end[best] = end[lists];
+      }
+      if (miss(slots[i]) == 0 && accept(i)) return entries[i];
+    }
+    if (lists == 0) return nullptr;
+    const uint32_t* a = list[0];
+    const uint32_t* aEnd = end[0];
+    if (lists == 2) {
+      const uint32_t* b = list[1];
+      const uint32_t* bEnd = end[1];
+      for (;;) {
+        const uint32_t i = *a < *b ? *a++ : *b++;
+        if (miss(slots[i]) == 0 && accept(i)) return entries[i];
+        if (a == aEnd) {
+          a = b;
+          aEnd = bEnd;
+          break;
+        }
+        if (b == bEnd) break;
+      }
+    }
+    for (; a != aEnd; a++) {
+      if (miss(slots[*a]) == 0 && accept(*a)) return entries[*a];
+    }
+    return nullptr;
+  }
+
+  // Two slots per iteration and one branch for both while neither passes;
+  // a passing pair is resolved in order, so the first match still wins.
+  uint32_t i = 0;
+  for (; i + 1 < count; i += 2) {
+    const uint64_t m0 = miss(slots[i]);
+    const uint64_t m1 = miss(slots[i + 1]);
+    if (__builtin_expect((m0 != 0) & (m1 != 0), 1)) continue;
+    if (m0 == 0 && accept(i)) return entries[i];
+    if (m1 == 0 && accept(i + 1)) return entries[i + 1];
+  }
+  if (i < count && miss(slots[i]) == 0 && accept(i)) return entries[i];
+  return nullptr;
 }
 
 }  // namespace
@@ -306,63 +416,5 @@ FWRuleEntry* FWFindRuleForPacket(SLCGenericFilter* filter, ZelPkt* pkt, uint32_t
     }
     return nullptr;
   }
-
-  const FWPacketKey k = PacketKey(s);
-  const FWScanSlot* const slots = index->slots;
-  auto miss = [&k](const FWScanSlot& slot) {
-    return ((k.k0 ^ slot.value[0]) & slot.mask[0]) | ((k.k1 ^ slot.value[1]) & slot.mask[1]) |
-           ((k.k2 ^ slot.value[2]) & slot.mask[2]) | ((k.k3 ^ slot.value[3]) & slot.mask[3]);
-  };
-  auto accept = [&](uint32_t i) {
-    return (slots[i].value[0] & FW_KEY0_EXACT) || FWRuleMatches(entries[i]->rule, &s);
-  };
-
-  if (const FWClassifier* cls = index->classifier; cls != nullptr) {
-    // The leaf of every tree and the residual list, merged in ascending
-    // slot order: the first slot that passes its test is the first match
-    // of the whole scan, reached through the same full tests.
-    const FWClsKey key = ClassifierKey(s);
-    const uint32_t* list[FW_CLS_TREES + 1];
-    const uint32_t* end[FW_CLS_TREES + 1];
-    uint32_t lists = 0;
-    for (uint32_t t = 0; t < FW_CLS_TREES; t++) {
-      if (cls->roots[t] == FW_CLS_NO_TREE) continue;
-      uint32_t n;
-      const uint32_t* leaf = FWClassifierLeaf(cls, cls->roots[t], key, &n);
-      if (n == 0) continue;
-      list[lists] = leaf;
-      end[lists++] = leaf + n;
-    }
-    if (cls->numResidual != 0) {
-      list[lists] = cls->residual;
-      end[lists++] = cls->residual + cls->numResidual;
-    }
-    while (lists != 0) {
-      uint32_t best = 0;
-      for (uint32_t j = 1; j < lists; j++) {
-        if (*list[j] < *list[best]) best = j;
-      }
-      const uint32_t i = *list[best]++;
-      if (list[best] == end[best]) {  // exhausted: the last list takes its place
-        lists--;
-        list[best] = list[lists];
-        end[best] = end[lists];
-      }
-      if (miss(slots[i]) == 0 && accept(i)) return entries[i];
-    }
-    return nullptr;
-  }
-
-  // Two slots per iteration and one branch for both while neither passes;
-  // a passing pair is resolved in order, so the first match still wins.
-  uint32_t i = 0;
-  for (; i + 1 < count; i += 2) {
-    const uint64_t m0 = miss(slots[i]);
-    const uint64_t m1 = miss(slots[i + 1]);
-    if (__builtin_expect((m0 != 0) & (m1 != 0), 1)) continue;
-    if (m0 == 0 && accept(i)) return entries[i];
-    if (m1 == 0 && accept(i + 1)) return entries[i + 1];
-  }
-  if (i < count && miss(slots[i]) == 0 && accept(i)) return entries[i];
-  return nullptr;
+  return index->l2Words ? FWFindKeyed<true>(index, s) : FWFindKeyed<false>(index, s);
 }

@@ -37,6 +37,9 @@ class Gen {
  public:
   explicit Gen(uint32_t seed) : rng_(seed) {}
 
+  // How often a rule compares each L2 field (MACs, ethertype, 802.1Q tag).
+  int l2Percent = 10;
+
   uint32_t U(uint32_t n) { return rng_() % n; }
   bool P(int percent) { return static_cast<int>(U(100)) < percent; }
 
@@ -128,16 +131,18 @@ class Gen {
         FWPutNet16(hi, P(5) ? static_cast<uint16_t>(l - 1) : static_cast<uint16_t>(l + U(2000)));
       }
     }
-    if (field(FW_WC_DMAC, 10)) {
+    if (field(FW_WC_DMAC, l2Percent)) {
       std::memcpy(r.dMac, kMacs[U(3)], 6);
       if (P(50)) {
         r.ruleFlags |= FW_MASK_DMAC;
         std::memcpy(r.dMacMask, kMasks[U(3)], 6);
       }
     }
-    if (field(FW_WC_SMAC, 10)) std::memcpy(r.sMac, kMacs[U(3)], 6);
-    if (field(FW_WC_ETHTYPE, 10)) FWPutNet16(r.ethType, P(50) ? 0x0800 : 0x86dd);
-    if (field(FW_WC_VLAN, 10)) r.vlan1QTag[0] = 0x81, r.vlan1QTag[3] = static_cast<uint8_t>(U(2));
+    if (field(FW_WC_SMAC, l2Percent)) std::memcpy(r.sMac, kMacs[U(3)], 6);
+    if (field(FW_WC_ETHTYPE, l2Percent)) FWPutNet16(r.ethType, P(50) ? 0x0800 : 0x86dd);
+    if (field(FW_WC_VLAN, l2Percent)) {
+      r.vlan1QTag[0] = 0x81, r.vlan1QTag[3] = static_cast<uint8_t>(U(2));
+    }
     for (uint32_t bit = 0; bit < 9; bit++) {
       if (P(4)) r.negateFlags |= 1u << bit;
     }
@@ -240,17 +245,46 @@ class ClassifierTest : public FirewallTest {
     FWFilterIoctlRequest(filter_, 7, msg.data(), msg.size());
   }
 
+  // Runs `attempt` with allocation 1, 2, ... failed until an attempt makes
+  // no allocation fail: each failed attempt must report the failure and
+  // leave the filter as it was; the last must succeed. Returns the
+  // attempts that failed.
+  template <typename Attempt>
+  uint64_t FailEachAllocation(const char* what, Attempt attempt) {
+    for (uint64_t n = 1;; n++) {
+      const Fingerprint before = Capture();
+      host::Faults::Fail("zel_HeapAllocWithRA", ZEL_NO_MEMORY, n);
+      const ZelStatus status = attempt();
+      const bool injected = host::Faults::Injected("zel_HeapAllocWithRA") > 0;
+      host::Faults::ClearAll();
+      if (!injected) {
+        EXPECT_EQ(status, ZEL_OK) << what;
+        return n - 1;
+      }
+      if (status != ZEL_FAILURE || !(Capture() == before)) {
+        ADD_FAILURE() << what << ": allocation " << n << " failed, status " << status
+                      << (Capture() == before ? "" : ", the filter changed");
+        return n;
+      }
+    }
+  }
+
   uint64_t checked_ = 0, hits_ = 0;
 };
 
 TEST_F(ClassifierTest, SameRuleAsTheOrderedScanForEveryPacket) {
-  uint64_t id = 1, built = 0, residual = 0, prepared = 0;
+  uint64_t id = 1, built = 0, residual = 0, prepared = 0, oneTree = 0, oneLeaf = 0,
+           noL2 = 0;
   for (uint32_t iter = 0; iter < 400; iter++) {
     Gen gen(0xc1a55000u + iter);
     // Leaves of 1 to 8 rules, and now and then a budget that stops the
     // cutting early.
+    // One tree or a tree per separating field.
     g_fwClassifierTuning = {1, 1 + gen.U(8), 1 + gen.U(24), gen.P(20) ? 1u + gen.U(4) : 64u,
-                            gen.P(30) ? 1u + gen.U(4) : 0u, 150};
+                            gen.P(30) ? 1u + gen.U(4) : 0u, 150, gen.P(50) ? 1000u : 0u};
+    // Now and then no rule compares an L2 field, so the lookup leaves the
+    // L2 key words out.
+    gen.l2Percent = gen.P(30) ? 0 : 10;
     FwModel model;
     const uint32_t applications = 1 + gen.U(3);
     for (uint32_t a = 0; a < applications; a++) {
@@ -275,6 +309,10 @@ TEST_F(ClassifierTest, SameRuleAsTheOrderedScanForEveryPacket) {
     ASSERT_NE(ctx_->scanIndex->classifier, nullptr);
     built++;
     residual += ctx_->scanIndex->classifier->numResidual;
+    oneTree += ctx_->scanIndex->classifier->numTrees == 1;
+    oneLeaf += ctx_->scanIndex->classifier->numTrees == 1 &&
+               ctx_->scanIndex->classifier->numResidual == 0;
+    noL2 += !ctx_->scanIndex->l2Words;
     ExpectSameAsModel(gen, model, iter, 300);
     if (HasFailure()) return;
 
@@ -301,6 +339,9 @@ TEST_F(ClassifierTest, SameRuleAsTheOrderedScanForEveryPacket) {
   EXPECT_EQ(built, 400u);
   EXPECT_GT(prepared, 100u);
   EXPECT_GT(residual, 0u);
+  EXPECT_GT(oneTree, 100u);
+  EXPECT_GT(oneLeaf, 5u);  // a lookup with a single leaf to walk (the sweep below: always)
+  EXPECT_GT(noL2, 50u);
   EXPECT_GT(hits_, checked_ / 3);
   RecordProperty("hits", std::to_string(hits_) + "/" + std::to_string(checked_));
 }
@@ -310,7 +351,7 @@ TEST_F(ClassifierTest, SameRuleAsTheOrderedScanForEveryPacket) {
 // often hold the same rules (and share a subtree): every cut boundary and
 // every range end is met, which packets drawn at random seldom do.
 TEST_F(ClassifierTest, EveryDestinationPortAgainstTheOrderedScan) {
-  g_fwClassifierTuning = {1, 1, 24, 256, 0, 0};
+  g_fwClassifierTuning = {1, 1, 24, 256, 0, 0, 0};
   uint64_t differing = 0;
   for (uint32_t seed = 0; seed < 12; seed++) {
     Gen gen(0x9047u + seed);
@@ -335,7 +376,10 @@ TEST_F(ClassifierTest, EveryDestinationPortAgainstTheOrderedScan) {
     }
     const auto rs = b.Bytes();
     ASSERT_EQ(Apply(rs, true), ZEL_OK);
-    ASSERT_NE(ctx_->scanIndex->classifier, nullptr);
+    const FWClassifier* cls = ctx_->scanIndex->classifier;
+    ASSERT_NE(cls, nullptr);
+    ASSERT_EQ(cls->numTrees, 1u);  // every rule in the port tree: one leaf per lookup
+    ASSERT_EQ(cls->numResidual, 0u);
     FwModel model;
     model.Apply(rs, true);
     ModelPacket p;
@@ -363,25 +407,32 @@ TEST_F(ClassifierTest, EveryDestinationPortAgainstTheOrderedScan) {
 }
 
 // Default limits on a larger ruleset, so the shipped configuration is
-// checked too.
+// checked too (its one tree), and the same limits with a tree per field:
+// lists this long choose their cuts on a sample.
 TEST_F(ClassifierTest, DefaultLimitsOnThousandsOfRules) {
   Gen gen(0xc1a5f00d);
   FwModel model;
   rules::RulesetBuilder b(8);
   for (uint64_t i = 0; i < 3000; i++) b.Add(gen.Rule(8, i + 1));
   const auto rs = b.Bytes();
-  ASSERT_EQ(Apply(rs, true), ZEL_OK);
   model.Apply(rs, true);
-  ASSERT_NE(ctx_->scanIndex->classifier, nullptr);
-  EXPECT_LT(ctx_->scanIndex->classifier->bytes, 3000u * 2048);
-  ExpectSameAsModel(gen, model, 0, 20000);
+  for (const uint32_t oneTreeRules : {kFWClassifierDefaults.oneTreeRules, 0u}) {
+    g_fwClassifierTuning = kFWClassifierDefaults;
+    g_fwClassifierTuning.oneTreeRules = oneTreeRules;
+    ASSERT_EQ(Apply(rs, true), ZEL_OK);
+    const FWClassifier* cls = ctx_->scanIndex->classifier;
+    ASSERT_NE(cls, nullptr);
+    EXPECT_EQ(cls->numTrees == 1, oneTreeRules != 0);
+    EXPECT_LT(cls->bytes, 3000u * 2048);
+    ExpectSameAsModel(gen, model, oneTreeRules, 20000);
+  }
 }
 
 // An allocation failed anywhere in the classifier's build undoes the whole
 // application, in replace and in add mode: the filter as it was, nothing
 // leaked; the next attempt succeeds.
 TEST_F(ClassifierTest, AllocationFailureAnywhereInTheBuildChangesNothing) {
-  g_fwClassifierTuning = {1, 2, 24, 64, 0, 0};
+  g_fwClassifierTuning = {1, 2, 24, 64, 0, 0, 1000};
   Gen gen(0xfa11);
   rules::RulesetBuilder first(8), next(8);
   for (uint64_t i = 0; i < 150; i++) first.Add(gen.Rule(8, i + 1));
@@ -389,21 +440,10 @@ TEST_F(ClassifierTest, AllocationFailureAnywhereInTheBuildChangesNothing) {
   ASSERT_EQ(Apply(first.Bytes(), true), ZEL_OK);
   const auto rs = next.Bytes();
   for (const bool replace : {true, false}) {
-    const Fingerprint before = Capture();
-    uint64_t failures = 0;
-    for (uint64_t n = 1;; n++) {
-      host::Faults::Fail("zel_HeapAllocWithRA", ZEL_NO_MEMORY, n);
-      const ZelStatus status = Apply(rs, replace);
-      const bool injected = host::Faults::Injected("zel_HeapAllocWithRA") > 0;
-      host::Faults::ClearAll();
-      if (!injected) {
-        EXPECT_EQ(status, ZEL_OK);
-        break;
-      }
-      failures++;
-      ASSERT_EQ(status, ZEL_FAILURE) << "allocation " << n;
-      ASSERT_TRUE(Capture() == before) << "allocation " << n << " changed the filter";
-    }
+    const uint64_t failures = FailEachAllocation(replace ? "replace" : "add", [&] {
+      return Apply(rs, replace);
+    });
+    if (HasFailure()) return;
     // Every rule record, the index, and the classifier's own blocks
     // (growing arrays included) were each failed once.
     EXPECT_GT(failures, 150u + 5u) << (replace ? "replace" : "add");
@@ -421,7 +461,7 @@ TEST_F(ClassifierTest, AllocationFailureAnywhereInTheBuildChangesNothing) {
 // granted, the filter holds exactly the new rules, and the former ones are
 // released after the hold (nothing leaks).
 TEST_F(ClassifierTest, ReplacementBuiltBeforeTheHoldUnderAllocationFailure) {
-  g_fwClassifierTuning = {1, 2, 24, 64, 0, 0};
+  g_fwClassifierTuning = {1, 2, 24, 64, 0, 0, 0};
   Gen gen(0xbefe);
   rules::RulesetBuilder first(8), next(8);
   for (uint64_t i = 0; i < 80; i++) first.Add(gen.Rule(8, i + 1));
@@ -452,22 +492,11 @@ TEST_F(ClassifierTest, ReplacementBuiltBeforeTheHoldUnderAllocationFailure) {
   for (const Channel& ch : channels) {
     ASSERT_EQ(Apply(first.Bytes(), true, ch.fromIoctl), ZEL_OK) << ch.name;
     const uint64_t heapBlocks = Capture().heapBlocks;
-    uint64_t failures = 0;
-    for (uint64_t n = 1;; n++) {
-      const Fingerprint before = Capture();
+    const uint64_t failures = FailEachAllocation(ch.name, [&] {
       std::vector<uint8_t> copy = next.Bytes();
-      host::Faults::Fail("zel_HeapAllocWithRA", ZEL_NO_MEMORY, n);
-      const ZelStatus status = ch.replace(filter_, copy);
-      const bool injected = host::Faults::Injected("zel_HeapAllocWithRA") > 0;
-      host::Faults::ClearAll();
-      if (!injected) {
-        ASSERT_EQ(status, ZEL_OK) << ch.name;
-        break;
-      }
-      failures++;
-      ASSERT_EQ(status, ZEL_FAILURE) << ch.name << " allocation " << n;
-      ASSERT_TRUE(Capture() == before) << ch.name << " allocation " << n << " changed the filter";
-    }
+      return ch.replace(filter_, copy);
+    });
+    if (HasFailure()) return;
     // Every record, the table, the index and the classifier's blocks.
     EXPECT_GT(failures, 80u + 3u) << ch.name;
     ASSERT_NE(ctx_->scanIndex->classifier, nullptr);
