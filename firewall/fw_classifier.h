@@ -88,7 +88,7 @@ struct FWClassifierTuning {
   uint32_t oneTreeRules;
 };
 extern FWClassifierTuning g_fwClassifierTuning;
-inline constexpr FWClassifierTuning kFWClassifierDefaults = {24, 16, 24, 256, 4, 4096, 4096};
+inline constexpr FWClassifierTuning kFWClassifierDefaults = {24, 16, 24, 256, 4, 4096, 16384};
 
 struct FWScanSlot;
 struct FWRuleEntry;

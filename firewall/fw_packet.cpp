@@ -16,6 +16,7 @@
 // walk to a pipelined shape that overlaps their cache misses (see
 // FWWalkList).
 
+#include "firewall/fw_index.h"
 #include "firewall/fw_packet.h"
 #include "firewall/fw_rules.h"
 #include "module/locks.h"
@@ -396,10 +397,12 @@ struct FWParsedPkt {
 };
 static_assert(sizeof(FWParsedPkt) == 144);
 
-// The exact-rule table as the walk reads it; fixed for the walk.
+// The exact-rule table as the walk reads it; fixed for the walk. `probe`
+// is false when the table holds no entry: packets then get no tuple.
 struct FWTableView {
   const ListLinks* buckets;
   uint32_t mask;
+  bool probe;
 };
 
 // Parses `pkt` into `slot`, with its tuple, hash and bucket when it has
@@ -414,7 +417,7 @@ __attribute__((always_inline)) inline void FWParseInto(ZelPkt* pkt, FWParsedPkt*
                &slot->summary);
   slot->pkt = pkt;
   slot->frameLen = frameLen;
-  if (slot->summary.presence & FW_PKT_PORTS) {
+  if (table.probe && (slot->summary.presence & FW_PKT_PORTS)) {
     const uint64_t hash = FWTupleFromSummary(&slot->summary, &slot->tuple);
     slot->hash = hash;
     const ListLinks* bucket = table.buckets + (static_cast<uint32_t>(hash) & table.mask);
@@ -550,7 +553,13 @@ void FWWalkPipelined(FWWalk* walk, FWLookahead* la, FWTableView table, uint32_t 
 // storage for the iterator that runs ahead.
 void FWWalkList(FWWalk* walk, ZelPktList* list, ZelPktListIter* ahead) {
   FWFilterContext* ctx = walk->ctx;
-  const FWTableView table = {ctx->ruleHash->buckets, ctx->ruleHash->numBuckets - 1};
+  // Every entry created since the rules were last cleared or replaced
+  // counts in numRules, which single removals do not lower; the scan index
+  // holds at most the general entries alive when it was built, all counted
+  // there. So when the two are equal, no exact entry is alive.
+  const uint32_t general = ctx->scanIndex != nullptr ? ctx->scanIndex->count : 0;
+  const FWTableView table = {ctx->ruleHash->buckets, ctx->ruleHash->numBuckets - 1,
+                             ctx->numRules != general};
   const uint32_t fragOverride = ctx->fragOverride;
   const bool haveGeneralRules = !List_IsEmpty(&ctx->ruleList);
   const bool early = ctx->fwFeatures != 0 || fragOverride != 0;
@@ -558,7 +567,7 @@ void FWWalkList(FWWalk* walk, ZelPktList* list, ZelPktListIter* ahead) {
   FWLookahead la;
   FWLookaheadStart(&la, list, ahead);
 
-  if (ctx->ruleHash->numBuckets < kPipelineMinBuckets) {
+  if (!table.probe || ctx->ruleHash->numBuckets < kPipelineMinBuckets) {
     FWParsedPkt cur;
     while (ZelPkt* pkt = FWLookaheadTake(&la)) {
       FWParseInto<false>(pkt, &cur, fragOverride, table);
