@@ -25,6 +25,20 @@ TEST_F(PacketVerdict, ExactRuleWinsAndEveryMatchIsCounted) {
   EXPECT_EQ(+GeneralEntries()[0]->rule.byteCount, general.size());
 }
 
+// A filter with general rules only gives packets no exact tuple; exact
+// rules added beside them must be probed again, and go unprobed once a
+// replacement leaves general rules only.
+TEST_F(PacketVerdict, ExactRulesAddedBesideGeneralOnesAreProbed) {
+  const std::string general = "action=drop ipv4 proto=tcp dport=80";
+  const Bytes hit = Tcp4(1234, 80, 10);
+  ApplyText(general);
+  EXPECT_EQ(RunFrames({hit}, 1), Frames{});
+  ASSERT_EQ(Apply(rules::ParseRuleset(ExactTcp4("accept")), /*replace=*/false), ZEL_OK);
+  EXPECT_EQ(RunFrames({hit}, 1), Frames{hit});
+  ApplyText(general);
+  EXPECT_EQ(RunFrames({hit}, 1), Frames{});
+}
+
 // Punted packets need an attached slow path, else the failure policy drops
 // (0) or passes (1) them; copies are cloned whatever the state.
 TEST_F(PacketVerdict, PuntAndCopyFollowAttachStateAndFailurePolicy) {
