@@ -654,14 +654,20 @@ class ExactBench {
 std::unique_ptr<ExactBench> exactBench;
 void DropExactBench() { exactBench.reset(); }
 
-void BM_ExactHits(benchmark::State& state) {
-  const uint32_t n = static_cast<uint32_t>(state.range(0));
+// The exact-rule bench of `n` rules, made when another is current.
+ExactBench& UseExact(uint32_t n) {
   current.reset();
   if (!exactBench || !exactBench->Is(n)) {
     exactBench.reset();
     exactBench = std::make_unique<ExactBench>(n);
   }
-  for (auto _ : state) exactBench->RunOne();
+  return *exactBench;
+}
+
+void BM_ExactHits(benchmark::State& state) {
+  const uint32_t n = static_cast<uint32_t>(state.range(0));
+  ExactBench& b = UseExact(n);
+  for (auto _ : state) b.RunOne();
   const double items = static_cast<double>(state.iterations()) * kListLen;
   state.SetItemsProcessed(static_cast<int64_t>(items));
   state.counters["ns_per_pkt"] =
@@ -669,28 +675,25 @@ void BM_ExactHits(benchmark::State& state) {
   state.counters["rules"] = static_cast<double>(n);
 }
 
-void BM_ApplyHold(benchmark::State& state) {
-  Bench& b = Use(static_cast<uint32_t>(state.range(0)), false);
-  HoldResult r{};
-  for (auto _ : state) r = b.Hold(state.range(1) != 0);
+void ReportHold(benchmark::State& state, const HoldResult& r) {
   state.counters["stall_ms"] = r.stallMs;
   state.counters["hold_ms"] = r.holdMs;
   state.counters["apply_ms"] = r.applyMs;
 }
+
+void BM_ApplyHold(benchmark::State& state) {
+  Bench& b = Use(static_cast<uint32_t>(state.range(0)), false);
+  HoldResult r{};
+  for (auto _ : state) r = b.Hold(state.range(1) != 0);
+  ReportHold(state, r);
+}
 BENCHMARK(BM_ApplyHold)->Args({10000, 0})->Args({10000, 1})->Iterations(1)->UseRealTime();
 
 void BM_ExactApplyHold(benchmark::State& state) {
-  const uint32_t n = static_cast<uint32_t>(state.range(0));
-  current.reset();
-  if (!exactBench || !exactBench->Is(n)) {
-    exactBench.reset();
-    exactBench = std::make_unique<ExactBench>(n);
-  }
+  ExactBench& b = UseExact(static_cast<uint32_t>(state.range(0)));
   HoldResult r{};
-  for (auto _ : state) r = exactBench->Hold();
-  state.counters["stall_ms"] = r.stallMs;
-  state.counters["hold_ms"] = r.holdMs;
-  state.counters["apply_ms"] = r.applyMs;
+  for (auto _ : state) r = b.Hold();
+  ReportHold(state, r);
 }
 BENCHMARK(BM_ExactApplyHold)->Arg(100000)->Iterations(1)->UseRealTime();
 
@@ -698,24 +701,15 @@ void BM_AddHold(benchmark::State& state) {
   Bench& b = Use(static_cast<uint32_t>(state.range(0)), false);
   HoldResult r{};
   for (auto _ : state) r = b.AddHold(state.range(1) != 0);
-  state.counters["stall_ms"] = r.stallMs;
-  state.counters["hold_ms"] = r.holdMs;
-  state.counters["apply_ms"] = r.applyMs;
+  ReportHold(state, r);
 }
 BENCHMARK(BM_AddHold)->Args({10000, 0})->Args({10000, 1})->Iterations(1)->UseRealTime();
 
 void BM_ExactAddHold(benchmark::State& state) {
-  const uint32_t n = static_cast<uint32_t>(state.range(0));
-  current.reset();
-  if (!exactBench || !exactBench->Is(n)) {
-    exactBench.reset();
-    exactBench = std::make_unique<ExactBench>(n);
-  }
+  ExactBench& b = UseExact(static_cast<uint32_t>(state.range(0)));
   HoldResult r{};
-  for (auto _ : state) r = exactBench->AddHold(10000, state.range(1) != 0);
-  state.counters["stall_ms"] = r.stallMs;
-  state.counters["hold_ms"] = r.holdMs;
-  state.counters["apply_ms"] = r.applyMs;
+  for (auto _ : state) r = b.AddHold(10000, state.range(1) != 0);
+  ReportHold(state, r);
 }
 BENCHMARK(BM_ExactAddHold)->Args({100000, 0})->Args({100000, 1})->Iterations(1)->UseRealTime();
 
