@@ -13,11 +13,12 @@
 
 #include <algorithm>
 #include <cstring>
+#include <functional>
 #include <optional>
 #include <random>
 #include <tuple>
-#include <vector>
 #include <string>
+#include <vector>
 
 #include "control/control.h"
 #include "firewall/fw_classifier.h"
@@ -46,18 +47,13 @@ class Gen {
   // Addresses inside 10.0.0.0/22 (IPv4) or 2001:db8:X::/48 with X < 4 and
   // a small interface part (IPv6), so that prefixes and ranges overlap.
   void Addr(bool v4, uint8_t out[16]) {
+    static const uint8_t kV6[4] = {0x20, 0x01, 0x0d, 0xb8};
     std::memset(out, 0, 16);
     if (v4) {
-      const uint32_t a = 0x0a000000u | U(1024);
-      out[0] = a >> 24;
-      out[1] = a >> 16;
-      out[2] = a >> 8;
-      out[3] = a;
+      const uint32_t a = htonl(0x0a000000u | U(1024));
+      std::memcpy(out, &a, 4);
     } else {
-      out[0] = 0x20;
-      out[1] = 0x01;
-      out[2] = 0x0d;
-      out[3] = 0xb8;
+      std::memcpy(out, kV6, 4);
       out[5] = static_cast<uint8_t>(U(4));
       out[15] = static_cast<uint8_t>(U(16));
     }
@@ -104,20 +100,14 @@ class Gen {
       r.ruleFlags &= ~wc;
       return true;
     };
-    if (field(FW_WC_IPSA, 60)) {
+    for (auto [wc, range, lo, hi] : {std::tuple{FW_WC_IPSA, FW_RANGE_IPSA, r.ipSa, r.ipSaHigh},
+                                     std::tuple{FW_WC_IPDA, FW_RANGE_IPDA, r.ipDa, r.ipDaHigh}}) {
+      if (!field(wc, 60)) continue;
       if (P(40)) {
-        r.ruleFlags |= FW_RANGE_IPSA;
-        AddrRange(v4, r.ipSa, r.ipSaHigh);
+        r.ruleFlags |= range;
+        AddrRange(v4, lo, hi);
       } else {
-        Addr(v4, r.ipSa);
-      }
-    }
-    if (field(FW_WC_IPDA, 60)) {
-      if (P(40)) {
-        r.ruleFlags |= FW_RANGE_IPDA;
-        AddrRange(v4, r.ipDa, r.ipDaHigh);
-      } else {
-        Addr(v4, r.ipDa);
+        Addr(v4, lo);
       }
     }
     if (field(FW_WC_IPPROTO, 60)) r.ipProto = P(90) ? (P(50) ? 6 : 17) : 1;
@@ -236,15 +226,6 @@ class ClassifierTest : public FirewallTest {
     }
   }
 
-  void Remove(const FWRule& rule) {
-    std::vector<uint8_t> msg(8);
-    const uint32_t head[2] = {FWIoctlMsgClear, FWClearMethodRemove};
-    std::memcpy(msg.data(), head, sizeof(head));
-    const auto rs = rules::RulesetBuilder(8).Add(rule).Bytes();
-    msg.insert(msg.end(), rs.begin(), rs.end());
-    FWFilterIoctlRequest(filter_, 7, msg.data(), msg.size());
-  }
-
   // Runs `attempt` with allocation 1, 2, ... failed until an attempt makes
   // no allocation fail: each failed attempt must report the failure and
   // leave the filter as it was; the last must succeed. Returns the
@@ -277,9 +258,8 @@ TEST_F(ClassifierTest, SameRuleAsTheOrderedScanForEveryPacket) {
            noL2 = 0;
   for (uint32_t iter = 0; iter < 400; iter++) {
     Gen gen(0xc1a55000u + iter);
-    // Leaves of 1 to 8 rules, and now and then a budget that stops the
-    // cutting early.
-    // One tree or a tree per separating field.
+    // Leaves of 1 to 8 rules, now and then a budget that stops the cutting
+    // early; one tree or a tree per separating field.
     g_fwClassifierTuning = {1, 1 + gen.U(8), 1 + gen.U(24), gen.P(20) ? 1u + gen.U(4) : 64u,
                             gen.P(30) ? 1u + gen.U(4) : 0u, 150, gen.P(50) ? 1000u : 0u};
     // Now and then no rule compares an L2 field, so the lookup leaves the
@@ -319,20 +299,18 @@ TEST_F(ClassifierTest, SameRuleAsTheOrderedScanForEveryPacket) {
     // Remove a few rules one by one. The reference is the model of the
     // rules left in the list, in order (which of several equal rules a
     // removal picks is the removal's business).
-    std::vector<FWRule> left = model.General();
-    for (uint32_t r = 0; r < 3 && left.size() > 1; r++) {
-      Remove(left[gen.U(static_cast<uint32_t>(left.size()))]);
+    const std::vector<FWRule>& general = model.General();
+    for (uint32_t r = 0; r < 3 && general.size() > 1; r++) {
+      RemoveByIoctl(rules::RulesetBuilder(8).Add(general[gen.U(uint32_t(general.size()))]).Bytes());
     }
-    left.clear();
-    for (const FWRuleEntry* e : GeneralEntries()) left.push_back(e->rule);
     // A lone general rule is kept, so that the classifier has rules left.
-    if (model.General().size() > 1) {
-      ASSERT_LT(left.size(), model.General().size()) << "iteration " << iter;
+    if (general.size() > 1) {
+      ASSERT_LT(GeneralEntries().size(), general.size()) << "iteration " << iter;
     }
+    rules::RulesetBuilder left(8);
+    for (const FWRuleEntry* e : GeneralEntries()) left.Add(e->rule);
     FwModel after;
-    rules::RulesetBuilder b(8);
-    for (const FWRule& r : left) b.Add(r);
-    after.Apply(b.Bytes(), true);
+    after.Apply(left.Bytes(), true);
     ExpectSameAsModel(gen, after, iter, 100);
     if (HasFailure()) return;
   }
@@ -365,8 +343,6 @@ TEST_F(ClassifierTest, EveryDestinationPortAgainstTheOrderedScan) {
       r.direction = SLCGenericDirectionBidirectional;
       r.pktCount = i + 1;
       r.ruleFlags = (FW_WC_FIELDS & ~FW_WC_DPORT) | FW_WC_RPTAG | FW_FLAG_IPV4 | FW_RANGE_DPORT;
-      // Crowded into a window, so that the tree cuts deep on this one
-      // dimension and sibling regions often hold the same rules.
       static const uint32_t kSpan[] = {1, 8, 64, 300};
       const uint32_t lo = window + gen.U(1024);
       const uint32_t hi = std::min<uint32_t>(65535, lo + gen.U(kSpan[gen.U(4)]));
@@ -376,12 +352,12 @@ TEST_F(ClassifierTest, EveryDestinationPortAgainstTheOrderedScan) {
     }
     const auto rs = b.Bytes();
     ASSERT_EQ(Apply(rs, true), ZEL_OK);
-    const FWClassifier* cls = ctx_->scanIndex->classifier;
-    ASSERT_NE(cls, nullptr);
-    ASSERT_EQ(cls->numTrees, 1u);  // every rule in the port tree: one leaf per lookup
-    ASSERT_EQ(cls->numResidual, 0u);
     FwModel model;
     model.Apply(rs, true);
+    const FWClassifier* cls = ctx_->scanIndex->classifier;
+    ASSERT_NE(cls, nullptr);
+    // Every rule in the port tree: one leaf per lookup.
+    ASSERT_TRUE(cls->numTrees == 1 && cls->numResidual == 0);
     ModelPacket p;
     p.presence |= FW_PKT_L2 | FW_PKT_L3 | FW_PKT_IPV4 | FW_PKT_PORTS | FW_PKT_TCP;
     FWPutNet16(p.ethType, 0x0800);
@@ -391,12 +367,10 @@ TEST_F(ClassifierTest, EveryDestinationPortAgainstTheOrderedScan) {
       FWPutNet16(p.dPort, static_cast<uint16_t>(port));
       const FWRuleEntry* got = Lookup(p, 1);
       const auto want = model.Match(p.Summary(), 1, 0);
-      ASSERT_EQ(static_cast<bool>(got), want.has_value()) << "seed " << seed << " port " << port;
-      if (got) {
-        ASSERT_TRUE(testsupport::SameRecord(got->rule, *want))
-            << "seed " << seed << " port " << port << "\n  module: "
-            << rules::FormatRule(got->rule) << "\n  model:  " << rules::FormatRule(*want);
-      }
+      ASSERT_TRUE(got ? want && testsupport::SameRecord(got->rule, *want) : !want)
+          << "seed " << seed << " port " << port << "\n  module: "
+          << (got ? rules::FormatRule(got->rule) : "none")
+          << "\n  model:  " << (want ? rules::FormatRule(*want) : "none");
       differing += want.has_value() != previous.has_value() ||
                    (want && !testsupport::SameRecord(*want, *previous));
       previous = want;
@@ -428,81 +402,55 @@ TEST_F(ClassifierTest, DefaultLimitsOnThousandsOfRules) {
   }
 }
 
-// An allocation failed anywhere in the classifier's build undoes the whole
-// application, in replace and in add mode: the filter as it was, nothing
-// leaked; the next attempt succeeds.
+// An allocation failed anywhere in building a new ruleset (records, table,
+// index, the classifier's blocks and growing arrays) undoes the whole
+// application on every road, in replace and in add mode: the filter as it
+// was, nothing leaked. The replacing channels build all of it before the
+// exclusive hold; with every allocation granted the filter holds the new
+// rules, and the former ones are released after the hold.
 TEST_F(ClassifierTest, AllocationFailureAnywhereInTheBuildChangesNothing) {
-  g_fwClassifierTuning = {1, 2, 24, 64, 0, 0, 1000};
   Gen gen(0xfa11);
   rules::RulesetBuilder first(8), next(8);
   for (uint64_t i = 0; i < 150; i++) first.Add(gen.Rule(8, i + 1));
   for (uint64_t i = 0; i < 150; i++) next.Add(gen.Rule(8, 1000 + i));
-  ASSERT_EQ(Apply(first.Bytes(), true), ZEL_OK);
-  const auto rs = next.Bytes();
-  for (const bool replace : {true, false}) {
-    const uint64_t failures = FailEachAllocation(replace ? "replace" : "add", [&] {
-      return Apply(rs, replace);
+  const std::vector<uint8_t> rs = next.Bytes();
+  struct Road {
+    const char* name;
+    bool replace, fromIoctl;
+    uint32_t oneTreeRules;
+    std::function<ZelStatus(std::vector<uint8_t>&)> apply;
+  };
+  // The ioctl roads last: after them the other two are ignored for good.
+  const Road roads[] = {
+      {"property", true, false, 0, [&](std::vector<uint8_t>& b) {
+         return SLCGenericRulesetPropWrite(filter_, nullptr, b.data(), uint32_t(b.size()));
+       }},
+      {"restore", true, false, 0,
+       [&](std::vector<uint8_t>& b) { return FWRestoreState(filter_, b.data(), b.size()); }},
+      {"replace", true, true, 1000, [&](std::vector<uint8_t>& b) { return Apply(b, true); }},
+      {"add", false, true, 1000, [&](std::vector<uint8_t>& b) { return Apply(b, false); }},
+      {"ioctl", true, true, 0, [&](std::vector<uint8_t>& b) {
+         return FWSetIoctlRuleset(filter_, reinterpret_cast<FWRuleset*>(b.data()), 1);
+       }},
+  };
+  for (const Road& road : roads) {
+    g_fwClassifierTuning = {1, 2, 24, 64, 0, 0, road.oneTreeRules};
+    ASSERT_EQ(Apply(first.Bytes(), true, road.fromIoctl), ZEL_OK) << road.name;
+    const uint64_t heapBlocks = Capture().heapBlocks;
+    const uint64_t failures = FailEachAllocation(road.name, [&] {
+      std::vector<uint8_t> copy = rs;
+      return road.apply(copy);
     });
     if (HasFailure()) return;
-    // Every rule record, the index, and the classifier's own blocks
-    // (growing arrays included) were each failed once.
-    EXPECT_GT(failures, 150u + 5u) << (replace ? "replace" : "add");
+    // Every rule record, the index and the classifier's blocks.
+    EXPECT_GT(failures, 150u + 5u) << road.name;
+    ASSERT_NE(ctx_->scanIndex->classifier, nullptr);
     FwModel model;
     model.Apply(first.Bytes(), true);
-    model.Apply(rs, replace);
-    ExpectSameAsModel(gen, model, 0, 2000);
-    ASSERT_EQ(Apply(first.Bytes(), true), ZEL_OK);
-  }
-}
-
-// Every channel that replaces a ruleset builds the new rules (entries,
-// table, index, classifier) before the exclusive hold. An allocation failed
-// anywhere in that build leaves the filter as it was; with every allocation
-// granted, the filter holds exactly the new rules, and the former ones are
-// released after the hold (nothing leaks).
-TEST_F(ClassifierTest, ReplacementBuiltBeforeTheHoldUnderAllocationFailure) {
-  g_fwClassifierTuning = {1, 2, 24, 64, 0, 0, 0};
-  Gen gen(0xbefe);
-  rules::RulesetBuilder first(8), next(8);
-  for (uint64_t i = 0; i < 80; i++) first.Add(gen.Rule(8, i + 1));
-  for (uint64_t i = 0; i < 80; i++) next.Add(gen.Rule(8, 1000 + i));
-  FwModel model;
-  model.Apply(next.Bytes(), true);
-  struct Channel {
-    const char* name;
-    bool fromIoctl;
-    ZelStatus (*replace)(SLCGenericFilter*, std::vector<uint8_t>&);
-  };
-  // Last the ioctl road, after which the other two are ignored for good.
-  const Channel channels[] = {
-      {"property", false,
-       [](SLCGenericFilter* f, std::vector<uint8_t>& rs) {
-         return SLCGenericRulesetPropWrite(f, nullptr, rs.data(),
-                                           static_cast<uint32_t>(rs.size()));
-       }},
-      {"restore", false,
-       [](SLCGenericFilter* f, std::vector<uint8_t>& rs) {
-         return FWRestoreState(f, rs.data(), rs.size());
-       }},
-      {"ioctl", true,
-       [](SLCGenericFilter* f, std::vector<uint8_t>& rs) {
-         return FWSetIoctlRuleset(f, reinterpret_cast<FWRuleset*>(rs.data()), 1);
-       }},
-  };
-  for (const Channel& ch : channels) {
-    ASSERT_EQ(Apply(first.Bytes(), true, ch.fromIoctl), ZEL_OK) << ch.name;
-    const uint64_t heapBlocks = Capture().heapBlocks;
-    const uint64_t failures = FailEachAllocation(ch.name, [&] {
-      std::vector<uint8_t> copy = next.Bytes();
-      return ch.replace(filter_, copy);
-    });
-    if (HasFailure()) return;
-    // Every record, the table, the index and the classifier's blocks.
-    EXPECT_GT(failures, 80u + 3u) << ch.name;
-    ASSERT_NE(ctx_->scanIndex->classifier, nullptr);
-    ExpectSameAsModel(gen, model, 0, 300);
-    ASSERT_EQ(Apply(first.Bytes(), true, ch.fromIoctl), ZEL_OK);
-    EXPECT_EQ(Capture().heapBlocks, heapBlocks) << ch.name;
+    model.Apply(rs, road.replace);
+    ExpectSameAsModel(gen, model, 0, 1000);
+    ASSERT_EQ(Apply(first.Bytes(), true, road.fromIoctl), ZEL_OK);
+    EXPECT_EQ(Capture().heapBlocks, heapBlocks) << road.name;
     Clear();
   }
 }

@@ -1,5 +1,6 @@
 #include "tests/support/fw_fixture.h"
 
+#include "firewall/fw_ioctl.h"
 #include "module/module.h"
 #include "tests/support/migration_support.h"
 
@@ -29,6 +30,15 @@ std::vector<uint8_t> FirewallTest::Populate() { return migsupport::Rules(filter_
 void FirewallTest::Clear() {
   SLCGenericWriteGuard guard(ctx_->configLock);
   FWClearRules(ctx_);
+}
+
+void FirewallTest::RemoveByIoctl(const std::vector<uint8_t>& ruleset) {
+  std::vector<uint8_t> msg(8);
+  const uint32_t head[2] = {FWIoctlMsgClear, FWClearMethodRemove};
+  std::memcpy(msg.data(), head, sizeof(head));
+  msg.insert(msg.end(), ruleset.begin(), ruleset.end());
+  host::Sluice::SendIoctl(id_, 1, msg);
+  (void)host::Sluice::TakeIoctlReplies(id_);
 }
 
 std::vector<FWRuleEntry*> FirewallTest::ExactEntries() {

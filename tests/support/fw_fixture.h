@@ -26,6 +26,9 @@ class FirewallTest : public ModuleTest {
   std::vector<uint8_t> Populate();
   // FWClearRules under the write lock.
   void Clear();
+  // Removes the rules of `ruleset` one by one through the ioctl channel
+  // (replies dropped).
+  void RemoveByIoctl(const std::vector<uint8_t>& ruleset);
 
   // Installed entries: the exact ones in table order (bucket by bucket,
   // oldest first), the general ones in ruleset order.
