@@ -262,8 +262,7 @@ TEST_F(StagedAddTest, AdditionsRaceAnotherWriterAndPackets) {
   ExpectIndexMatchesList();
 
   // Flow 0 is in every ruleset here and never removed.
-  const FWRule flow0Rule = rules::ParseRule(Flow(0));
-  const FWRuleEntry* flow0 = FindExact(flow0Rule);
+  const FWRuleEntry* flow0 = FindExact(rules::ParseRule(Flow(0)));
   ASSERT_NE(flow0, nullptr);
   const uint64_t before = flow0->rule.pktCount;
   stop.store(false);
@@ -275,7 +274,7 @@ TEST_F(StagedAddTest, AdditionsRaceAnotherWriterAndPackets) {
   }
   stop.store(true);
   packets.join();
-  flow0 = FindExact(flow0Rule);
+  flow0 = FindExact(rules::ParseRule(Flow(0)));
   ASSERT_NE(flow0, nullptr);
   EXPECT_EQ(flow0->rule.pktCount - before, sent.load())
       << "packets counted while rules were added were lost";
