@@ -12,8 +12,10 @@ constexpr uint32_t kSlotAlign = 64;
 static_assert(alignof(FWScanSlot) <= kSlotAlign);
 static_assert(sizeof(FWScanIndex) <= kSlotAlign, "the header fits before the first slot");
 // Per rule: one slot and one entry pointer.
-constexpr uint64_t kBytesPerRule = sizeof(FWScanSlot) + sizeof(FWRuleEntry*);
-// Header, alignment slack, then the slots and the entry pointers.
+constexpr uint64_t kBytesPerRule =
+    sizeof(FWScanSlot) + sizeof(FWRuleEntry*) + sizeof(FWPortRanges);
+// Header, alignment slack, then the slots, the entry pointers and the port
+// ranges.
 constexpr uint64_t kFixedBytes = sizeof(FWScanIndex) + kSlotAlign;
 
 // The leading bits that every value of [lo, hi] shares (numeric order);
@@ -30,6 +32,8 @@ struct SlotBuilder {
   uint64_t value[4] = {};
   uint64_t mask[4] = {};
   bool exact = true;
+  bool portRanges = false;  // a port range that is not a prefix, in ranges
+  FWPortRanges ranges = {0, 0xffff, 0, 0xffff};
 
   void Require(uint32_t word, uint64_t fieldMask, uint64_t fieldValue) {
     mask[word] |= fieldMask;
@@ -56,8 +60,10 @@ struct SlotBuilder {
             static_cast<uint64_t>(__builtin_bswap32(l & prefix)) << shift);
   }
 
-  // A port as stored, at `shift` of word 0; a range as for IPv4.
-  void Port(const uint8_t* lo, const uint8_t* hi, bool range, uint32_t shift) {
+  // A port as stored, at `shift` of word 0; a range as for IPv4, which
+  // when it is not a prefix also goes to `ranges` (`*lo`, `*hi`).
+  void Port(const uint8_t* lo, const uint8_t* hi, bool range, uint32_t shift, uint16_t* rangeLo,
+            uint16_t* rangeHi) {
     if (!range) {
       Require(0, 0xffffull << shift, static_cast<uint64_t>(FWLoad16(lo)) << shift);
       return;
@@ -68,14 +74,18 @@ struct SlotBuilder {
       return;
     }
     const uint32_t prefix = CommonPrefix32(l << 16, h << 16) >> 16;
-    if ((l & ~prefix) != 0 || (h | prefix) != 0xffffu) exact = false;
+    if ((l & ~prefix) != 0 || (h | prefix) != 0xffffu) {
+      portRanges = true;
+      *rangeLo = static_cast<uint16_t>(l);
+      *rangeHi = static_cast<uint16_t>(h);
+    }
     Require(0, static_cast<uint64_t>(__builtin_bswap16(static_cast<uint16_t>(prefix))) << shift,
             static_cast<uint64_t>(__builtin_bswap16(static_cast<uint16_t>(l & prefix)))
                 << shift);
   }
 };
 
-void SlotFromRule(const FWRule& r, FWScanSlot* slot) {
+void SlotFromRule(const FWRule& r, FWScanSlot* slot, FWPortRanges* ranges) {
   const uint32_t f = r.ruleFlags;
   const uint32_t n = r.negateFlags;
   const uint32_t need = ~f & FW_WC_ALL;
@@ -162,17 +172,20 @@ void SlotFromRule(const FWRule& r, FWScanSlot* slot) {
   // Steps 11-12. A rule comparing a port requires its presence bit, so a
   // packet without ports (step 10) never reaches these words.
   if (compared(FW_WC_SPORT, FW_NEG_SPORT) && !comparesTag) {
-    b.Port(r.sPort, r.sPortHigh, (f & FW_RANGE_SPORT) != 0, FW_KEY0_SPORT_SHIFT);
+    b.Port(r.sPort, r.sPortHigh, (f & FW_RANGE_SPORT) != 0, FW_KEY0_SPORT_SHIFT,
+           &b.ranges.sLo, &b.ranges.sHi);
   }
   if (compared(FW_WC_DPORT, FW_NEG_DPORT) && !comparesTag) {
-    b.Port(r.dPort, r.dPortHigh, (f & FW_RANGE_DPORT) != 0, FW_KEY0_DPORT_SHIFT);
+    b.Port(r.dPort, r.dPortHigh, (f & FW_RANGE_DPORT) != 0, FW_KEY0_DPORT_SHIFT,
+           &b.ranges.dLo, &b.ranges.dHi);
   }
 
   for (uint32_t w = 0; w < 4; w++) {
     slot->value[w] = b.value[w];
     slot->mask[w] = b.mask[w];
   }
-  if (b.exact) slot->value[0] |= FW_KEY0_EXACT;
+  *ranges = b.ranges;
+  if (b.exact) slot->value[0] |= b.portRanges ? FW_KEY0_PORT_RANGES : FW_KEY0_EXACT;
 }
 
 }  // namespace
@@ -197,6 +210,7 @@ ZelStatus FWScanIndexBuild(const ListLinks* ruleList, FWScanIndex** index,
   const uintptr_t first = reinterpret_cast<uintptr_t>(block + sizeof(FWScanIndex));
   idx->slots = reinterpret_cast<FWScanSlot*>((first + kSlotAlign - 1) & ~uintptr_t{kSlotAlign - 1});
   idx->entries = reinterpret_cast<FWRuleEntry**>(idx->slots + count);
+  idx->ranges = reinterpret_cast<FWPortRanges*>(idx->entries + count);
   idx->capacity = static_cast<uint32_t>(count);
 
   uint32_t i = 0;
@@ -205,7 +219,7 @@ ZelStatus FWScanIndexBuild(const ListLinks* ruleList, FWScanIndex** index,
     if (list == nullptr) continue;
     for (ListLinks* l = list->prev; l != list; l = l->prev, i++) {
       FWRuleEntry* entry = FWEntryFromLink(l);
-      SlotFromRule(entry->rule, &idx->slots[i]);
+      SlotFromRule(entry->rule, &idx->slots[i], &idx->ranges[i]);
       idx->entries[i] = entry;
       idx->l2Words |= (idx->slots[i].mask[2] | idx->slots[i].mask[3]) != 0;
     }
@@ -245,6 +259,7 @@ void FWScanIndexForget(FWScanIndex* index, const FWRuleEntry* entry) {
     for (uint32_t j = i + 1; j < index->count; j++) {
       index->slots[j - 1] = index->slots[j];
       index->entries[j - 1] = index->entries[j];
+      index->ranges[j - 1] = index->ranges[j];
     }
     index->count--;
     return;

@@ -17,7 +17,10 @@
 // Negated fields, IPv6 ranges and the resource-pool tag are left out (mask
 // 0). A slot that passes goes through the full step-by-step test of the
 // rule, unless its value word 0 carries FW_KEY0_EXACT: then every test of
-// the rule is exactly the masked equality and passing it is matching.
+// the rule is exactly the masked equality and passing it is matching; or
+// FW_KEY0_PORT_RANGES: then the rule's only other tests are port ranges
+// (not negated, not empty), and matching is passing the slot with the
+// packet's ports inside the slot's FWPortRanges.
 //
 // Invariant (configLock): while the filter has general rules, scanIndex
 // lists exactly the entries of ruleList, back to front (ruleset order), and
@@ -35,11 +38,19 @@ struct FWScanSlot {
 };
 static_assert(sizeof(FWScanSlot) == 64, "one cache line per rule");
 
+// The numeric port ranges of a slot whose value word 0 carries
+// FW_KEY0_PORT_RANGES (inclusive; 0-65535 for a port the slot compares
+// exactly or not at all).
+struct FWPortRanges {
+  uint16_t sLo, sHi, dLo, dHi;
+};
+
 struct FWScanIndex {
   uint32_t count;          // slots in use, ruleset order
   uint32_t capacity;
   FWScanSlot* slots;       // inside this block, 64-byte aligned
   FWRuleEntry** entries;   // inside this block; entries[i] belongs to slots[i]
+  FWPortRanges* ranges;    // inside this block; ranges[i] belongs to slots[i]
   FWClassifier* classifier;  // separate block, or null: scan every slot
   bool l2Words;            // some slot masks key word 2 or 3; else the scan skips both
 };
@@ -54,6 +65,7 @@ inline constexpr uint64_t FW_KEY0_FAMILY_V4 = 1ull << 50;  // IPv4 packet, or no
 inline constexpr uint64_t FW_KEY0_FAMILY_V6 = 1ull << 51;  // IPv6 packet, or not IP
 inline constexpr uint64_t FW_KEY0_DIR_FROM = 1ull << 52;   // direction 1
 inline constexpr uint64_t FW_KEY0_DIR_TO = 1ull << 53;     // direction 2
+inline constexpr uint64_t FW_KEY0_PORT_RANGES = 1ull << 61;  // value only: exact once ranges hold
 inline constexpr uint64_t FW_KEY0_NEVER = 1ull << 62;      // never set in a packet key
 inline constexpr uint64_t FW_KEY0_EXACT = 1ull << 63;      // value only, outside every mask
 // Key word 1: source address in bits 0-31, destination in 32-63; IPv4 as

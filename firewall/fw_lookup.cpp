@@ -299,8 +299,17 @@ FWRuleEntry* FWFindKeyed(const FWScanIndex* index, FWScan& s) {
     }
     return m;
   };
-  auto accept = [&](uint32_t i) {
-    return (slots[i].value[0] & FW_KEY0_EXACT) || FWRuleMatches(entries[i]->rule, &s);
+  auto accept = [&](uint32_t i) __attribute__((always_inline)) {
+    const uint64_t v0 = slots[i].value[0];
+    if (v0 & FW_KEY0_EXACT) return true;
+    if (v0 & FW_KEY0_PORT_RANGES) {
+      const FWPortRanges& r = index->ranges[i];
+      const uint32_t sp = __builtin_bswap16(static_cast<uint16_t>(k.k0 >> FW_KEY0_SPORT_SHIFT));
+      const uint32_t dp = __builtin_bswap16(static_cast<uint16_t>(k.k0 >> FW_KEY0_DPORT_SHIFT));
+      return sp - r.sLo <= static_cast<uint32_t>(r.sHi - r.sLo) &&
+             dp - r.dLo <= static_cast<uint32_t>(r.dHi - r.dLo);
+    }
+    return FWRuleMatches(entries[i]->rule, &s);
   };
 
   if (const FWClassifier* cls = index->classifier; cls != nullptr) {
