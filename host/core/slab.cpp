@@ -30,7 +30,8 @@ void* SlabAlloc(size_t bytes) {
 }
 
 void SlabFree(void* block, size_t bytes) {
-  if (block != nullptr) ::operator delete(block, BlockSize(bytes), std::align_val_t{kSlabAlign});
+  (void)bytes;
+  if (block != nullptr) ::operator delete(block, std::align_val_t{kSlabAlign});
 }
 
 #else
