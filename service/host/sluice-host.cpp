@@ -5,6 +5,7 @@
 #include <signal.h>
 
 #include <CLI/CLI.hpp>
+#include <atomic>
 #include <chrono>
 #include <cstdio>
 #include <fstream>
@@ -18,9 +19,11 @@
 
 namespace {
 
-// Set from the signal handler, which may run on any thread.
-volatile sig_atomic_t gStopSignal = 0;
-void OnStopSignal(int sig) { gStopSignal = sig; }
+// Set from the signal handler, which may run on any thread: a lock-free
+// atomic, so that the main loop's read is ordered with it.
+std::atomic<int> gStopSignal{0};
+static_assert(std::atomic<int>::is_always_lock_free, "used from a signal handler");
+void OnStopSignal(int sig) { gStopSignal.store(sig, std::memory_order_relaxed); }
 
 struct Config {
   std::string socketPath = "/run/sluice-host.sock";
@@ -186,7 +189,7 @@ int main(int argc, char** argv) {
       for (;;) {
         timespec tick{0, 100 * 1000 * 1000};
         nanosleep(&tick, nullptr);
-        if (const int sig = gStopSignal; sig != 0) {
+        if (const int sig = gStopSignal.load(std::memory_order_relaxed); sig != 0) {
           std::fprintf(stderr, "sluice-host: %s, stopping\n",
                        sig == SIGTERM ? "SIGTERM" : "SIGINT");
           break;

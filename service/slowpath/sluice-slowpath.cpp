@@ -18,6 +18,7 @@
 #include <sys/time.h>
 #include <unistd.h>
 
+#include <atomic>
 #include <cerrno>
 #include <chrono>
 #include <cstdarg>
@@ -43,7 +44,8 @@ namespace {
 using slcproto::Message;
 using slcproto::Type;
 
-volatile sig_atomic_t gStop = 0;
+std::atomic<int> gStop{0};  // lock-free, so the signal handler may set it
+static_assert(std::atomic<int>::is_always_lock_free);
 void OnStop(int) { gStop = 1; }
 
 // Filter ioctl messages (the firewall's wire format, little-endian).
