@@ -428,9 +428,8 @@ __attribute__((always_inline)) inline void FWParseInto(ZelPkt* pkt, FWParsedPkt*
   }
 }
 
-// The first rule entry the exact probe will compare (its bucket's oldest),
-// three cache lines of it: links and hash, match fields and counters,
-// direction.
+// The three cache lines of a rule entry the exact probe reads: links and
+// hash, match fields and counters, direction.
 __attribute__((always_inline)) inline void FWPrefetchLines(const ListLinks* link) {
   const char* e = reinterpret_cast<const char*>(link);
   __builtin_prefetch(e);
@@ -438,6 +437,7 @@ __attribute__((always_inline)) inline void FWPrefetchLines(const ListLinks* link
   __builtin_prefetch(e + 128);
 }
 
+// The first rule entry the exact probe will compare: its bucket's oldest.
 __attribute__((always_inline)) inline void FWPrefetchEntry(const FWParsedPkt* slot) {
   const ListLinks* bucket = slot->bucket;
   if (bucket == nullptr) return;
