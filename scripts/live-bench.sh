@@ -66,6 +66,16 @@ print("%.1f%% %d %d %d %.1f" % (100.0 * mod / max(1, busy), busy / n, mod / n, t
                               n / max(1, t["batches"])))'
 }
 report() { printf '%-28s %10s %12s %7s %8s %8s %8s %6s\n' "$@"; }
+# One case through sluice-host: NAME, then a rules file (none: no rules).
+measure() {
+  local s d sh busy mod tx batch
+  start_host
+  [ -z "${2:-}" ] || "$CTL" --socket "$SOCK" ruleset set vm1.eth0 "$2" >/dev/null
+  read -r s d < <(blast)
+  read -r sh busy mod tx batch < <(share)
+  report "$1" "$s" "$d" "$sh" "$busy" "$mod" "$tx" "$batch"
+  stop_host
+}
 
 report "case" "sent/s" "delivered/s" "filter" "busy ns" "filt ns" "send ns" "batch"
 # Kernel bridge between the two sides: what the veth pairs carry unfiltered.
@@ -77,11 +87,7 @@ read -r s d < <(blast)
 report "kernel bridge (no filter)" "$s" "$d" "-" "-" "-" "-" "-"
 ip -n "$P-fp" link del br0
 
-start_host
-read -r s d < <(blast)
-read -r sh busy mod tx batch < <(share)
-report "sluice-host, no rules" "$s" "$d" "$sh" "$busy" "$mod" "$tx" "$batch"
-stop_host
+measure "sluice-host, no rules"
 
 {
   echo "ruleset version=8"
@@ -89,12 +95,7 @@ stop_host
     echo "action=accept dmac=02:00:00:00:77:02 smac=02:00:00:00:77:01 ethtype=0x0800 vlan=none ipv4 proto=udp sa=10.77.0.1 da=10.77.0.2 sport=$((10000 + f)) dport=9000"
   done
 } >"$DIR/exact.rules"
-start_host
-"$CTL" --socket "$SOCK" ruleset set vm1.eth0 "$DIR/exact.rules" >/dev/null
-read -r s d < <(blast)
-read -r sh busy mod tx batch < <(share)
-report "sluice-host, 1000 exact" "$s" "$d" "$sh" "$busy" "$mod" "$tx" "$batch"
-stop_host
+measure "sluice-host, 1000 exact" "$DIR/exact.rules"
 
 {
   echo "ruleset version=8"
@@ -103,9 +104,4 @@ stop_host
   done
   echo "action=accept ipv4 proto=udp dport=9000-9001"
 } >"$DIR/general.rules"
-start_host
-"$CTL" --socket "$SOCK" ruleset set vm1.eth0 "$DIR/general.rules" >/dev/null
-read -r s d < <(blast)
-read -r sh busy mod tx batch < <(share)
-report "sluice-host, 1000 general" "$s" "$d" "$sh" "$busy" "$mod" "$tx" "$batch"
-stop_host
+measure "sluice-host, 1000 general" "$DIR/general.rules"
