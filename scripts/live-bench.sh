@@ -14,13 +14,8 @@ if [ "$(id -u)" -ne 0 ]; then
   exit 1
 fi
 SECS=${1:-5}
-bash scripts/install-deps.sh
-cmake --preset tools >/dev/null
-cmake --build --preset tools -j 2 --target sluice-host sluice-ctl udp-blast >/dev/null
-HOST=build/tools/service/sluice-host
-CTL=build/tools/service/sluice-ctl
-BLAST=build/tools/service/udp-blast
 . scripts/live-topology.sh
+topo_build sluice-host sluice-ctl udp-blast
 
 P=bench$$
 DIR=$(mktemp -d /tmp/sluice-bench.XXXXXX)

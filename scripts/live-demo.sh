@@ -12,12 +12,8 @@ if [ "$(id -u)" -ne 0 ]; then
   echo "live-demo: needs root (network namespaces)" >&2
   exit 1
 fi
-bash scripts/install-deps.sh
-cmake --preset tools >/dev/null
-cmake --build --preset tools -j "$(nproc)" --target sluice-host sluice-ctl >/dev/null
-HOST=build/tools/service/sluice-host
-CTL=build/tools/service/sluice-ctl
 . scripts/live-topology.sh
+topo_build sluice-host sluice-ctl
 
 P=demo$$
 DIR=$(mktemp -d /tmp/sluice-demo.XXXXXX)

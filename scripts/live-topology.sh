@@ -13,6 +13,10 @@
 #   topo_require TOOL...
 #                 for tests: exits 77 (skipped) with the reason unless
 #                 running as root with every TOOL installed.
+#   topo_build TARGET...
+#                 for the scripts: installs what the project needs and
+#                 builds TARGETs (tools preset); HOST, CTL and BLAST name
+#                 sluice-host, sluice-ctl and udp-blast there.
 #
 # Helpers for the tests that drive traffic through it:
 #   topo_check NAME COMMAND...       runs COMMAND, prints ok/FAIL NAME and
@@ -32,6 +36,15 @@
 #
 # Senders have checksum and segmentation offload turned off so every frame
 # read from an interface is complete.
+
+topo_build() {
+  bash scripts/install-deps.sh
+  cmake --preset tools >/dev/null
+  cmake --build --preset tools -j 2 --target "$@" >/dev/null
+  HOST=build/tools/service/sluice-host
+  CTL=build/tools/service/sluice-ctl
+  BLAST=build/tools/service/udp-blast
+}
 
 topo_require() {
   if [ "$(id -u)" -ne 0 ]; then
