@@ -262,8 +262,7 @@ class ClassifierTest : public FirewallTest {
 };
 
 TEST_F(ClassifierTest, SameRuleAsTheOrderedScanForEveryPacket) {
-  uint64_t id = 1, built = 0, residual = 0, prepared = 0, oneTree = 0, oneLeaf = 0,
-           noL2 = 0;
+  uint64_t id = 1, residual = 0, prepared = 0, oneTree = 0, oneLeaf = 0, noL2 = 0;
   for (uint32_t iter = 0; iter < 400; iter++) {
     Gen gen(0xc1a55000u + iter);
     // Leaves of 1 to 8 rules, now and then a budget that stops the cutting
@@ -294,12 +293,11 @@ TEST_F(ClassifierTest, SameRuleAsTheOrderedScanForEveryPacket) {
       model.Apply(rs, a == 0);
     }
     ASSERT_NE(ctx_->scanIndex, nullptr);
-    ASSERT_NE(ctx_->scanIndex->classifier, nullptr);
-    built++;
-    residual += ctx_->scanIndex->classifier->numResidual;
-    oneTree += ctx_->scanIndex->classifier->numTrees == 1;
-    oneLeaf += ctx_->scanIndex->classifier->numTrees == 1 &&
-               ctx_->scanIndex->classifier->numResidual == 0;
+    const FWClassifier* cls = ctx_->scanIndex->classifier;
+    ASSERT_NE(cls, nullptr);
+    residual += cls->numResidual;
+    oneTree += cls->numTrees == 1;
+    oneLeaf += cls->numTrees == 1 && cls->numResidual == 0;
     noL2 += !ctx_->scanIndex->l2Words;
     ExpectSameAsModel(gen, model, iter, 300);
     if (HasFailure()) return;
@@ -322,7 +320,6 @@ TEST_F(ClassifierTest, SameRuleAsTheOrderedScanForEveryPacket) {
     ExpectSameAsModel(gen, after, iter, 100);
     if (HasFailure()) return;
   }
-  EXPECT_EQ(built, 400u);
   EXPECT_GT(prepared, 100u);
   EXPECT_GT(residual, 0u);
   EXPECT_GT(oneTree, 100u);

@@ -32,10 +32,9 @@ std::string Flow(uint32_t i, const std::string& action = "action=accept") {
 }
 
 Bytes FlowFrame(uint32_t i, uint16_t dport = 2000) {
-  const std::string sa = FlowSource(i);
   return frames::FrameBuilder()
       .Eth(frames::Mac("02:00:00:00:00:0a"), frames::Mac("02:00:00:00:00:0b"))
-      .Ipv4(frames::Ip4(sa), frames::Ip4("10.9.0.1"))
+      .Ipv4(frames::Ip4(FlowSource(i)), frames::Ip4("10.9.0.1"))
       .Udp(1000, dport)
       .Payload(10)
       .Build();

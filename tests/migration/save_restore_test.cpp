@@ -19,9 +19,7 @@ constexpr uint32_t kSlowPathId = 7;
 
 // The rules in force before a restore, so a refused one can be seen to leave them.
 Bytes Baseline() {
-  return rules::RulesetBuilder(8)
-      .Add(ExactRule("accept", "udp", "10.8.0.1", 5, "10.8.0.2", 6))
-      .Bytes();
+  return rules::RulesetBuilder(8).Add(ExactRule("accept", "udp", "10.8.0.1", 5, "10.8.0.2", 6)).Bytes();
 }
 
 class SaveRestoreTest : public MigrationTest {

@@ -154,10 +154,7 @@ class Life {
     Undoable("agent creation through the status tree", [&] {
       return host::StatusTree::Set({"createAgent"}, {"sweep-c"}) == ZEL_OK;
     });
-    host::FilterConfig config;
-    config.name = "vnic0";
-    config.parameters[0] = "p1";
-    config.vmUUID = "vm-a";
+    const host::FilterConfig config{.name = "vnic0", .vmUUID = "vm-a", .parameters = {"p1"}};
     Undoable("filter creation", [&] { return host::Sluice::CreateFilter(kAgent, config, &a_) == ZEL_OK; });
     slowPath_ = host::Sluice::RegisterSlowPath(kAgent, kSlowPath) == ZEL_OK;
     host::Timers::RunDue();
@@ -249,9 +246,7 @@ class Life {
     SLCGenericFilter* fa = Priv(a_);
     SLCGenericPrefetchSavedState(fa);
     const Bytes state = migsupport::Save(fa);
-    host::FilterConfig config;
-    config.name = "vnic1";
-    config.vmUUID = "vm-b";
+    const host::FilterConfig config{.name = "vnic1", .vmUUID = "vm-b", .parameters = {}};
     Undoable("second filter creation",
              [&] { return host::Sluice::CreateFilter(kAgent, config, &b_) == ZEL_OK; });
     if (b_ == 0 || state.empty()) return;
@@ -414,10 +409,6 @@ TEST(FailureSweep, EveryReachedPointFailedLeavesNothingAndUndoes) {
                                      << " but no run of the sweep reaches it";
   }
 }
-
-}  // namespace
-
-namespace {
 
 // An agent whose creation fails after registering, and whose unregistration
 // then fails too, stays registered: the framework may still call in with
