@@ -1,7 +1,6 @@
 // Filter records: configuration reads, creation failing at each step,
 // destruction while requests are in flight, and garbage on every callback.
 
-#include "migration/migration.h"
 #include <cstring>
 
 #include "tests/support/module_fixture.h"
@@ -39,9 +38,6 @@ TEST_F(Filters, ReadsItsConfiguration) {
     EXPECT_EQ(f->endPointType, c.config.endPointType);
     EXPECT_STREQ(f->vmUUID, c.vmUUID);
     EXPECT_EQ(f->vnicIndex, c.vnicIndex);
-    EXPECT_EQ(f->refCount, 1u);
-    EXPECT_EQ(f->spAttachState, SLCGenericSpDetached);
-    EXPECT_EQ(f->migrationState, SLCGenericStateIdle);
   }
 }
 
@@ -93,18 +89,6 @@ TEST_F(Filters, CreationFailuresFreeEverything) {
   EXPECT_TRUE(host::Log::Contains("Failed to allocate memory for agent context", 2));
 
   EXPECT_TRUE(List_IsEmpty(&Agent()->filters));
-}
-
-TEST_F(Filters, ListedInOrderOfCreation) {
-  host::FilterId a = CreateFilter(kDefaultAgent, "a");
-  host::FilterId b = CreateFilter(kDefaultAgent, "b");
-  host::FilterId c = CreateFilter(kDefaultAgent, "c");
-  ASSERT_EQ(host::Sluice::DestroyFilter(b), ZEL_OK);
-  std::vector<SLCGenericFilter*> listed;
-  for (ListLinks* l = Agent()->filters.next; l != &Agent()->filters; l = l->next) {
-    listed.push_back(SLCGenericFilterFromLink(l));
-  }
-  EXPECT_EQ(listed, (std::vector<SLCGenericFilter*>{Filter(a), Filter(c)}));
 }
 
 TEST_F(Filters, DestroyIsBusyWhileAReplyIsOutstanding) {

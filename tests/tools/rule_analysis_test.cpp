@@ -205,8 +205,7 @@ TEST(Diff, CaptureVerdictsComeFromTheModule) {
 class ModuleReadBack : public testsupport::ModuleTest {};
 
 TEST_F(ModuleReadBack, DecodedRulesetsCompileToTheBytesTheModuleWrote) {
-  const std::string tuple =
-      "dmac=02:00:00:00:00:01 smac=02:00:00:00:00:02 vlan=none ipv4 sa=10.0.0.1 da=10.0.0.2 proto=tcp";
+  const std::string tuple = kTuple;
   const std::string texts[] = {
       "ruleset version=8 features=drop-dhcp-server frag=punt\n"
       "action=accept dir=to " + tuple + " sport=1000 dport=22 bidir pkts=3 bytes=180\n"
