@@ -310,8 +310,8 @@ struct Builder {
     const uint32_t childBase = nodes.size;
     nodes.size += children;
     const uint32_t shift = reg.width[d] - bestBits;
-    nodes.data[node] = FWClsNode{childBase, 0, static_cast<uint8_t>(d),
-                                 static_cast<uint8_t>(shift),
+    nodes.data[node] = FWClsNode{childBase, 0, kFWClsDimWord[d],
+                                 static_cast<uint8_t>(kFWClsDimShift[d] + shift),
                                  static_cast<uint16_t>(children - 1)};
 
     Region sub = reg;

@@ -46,8 +46,8 @@ inline constexpr uint32_t FW_CLS_DIMS = 5;
 struct FWClsNode {
   uint32_t base;   // internal: first child node; leaf: first slot number in leaves
   uint32_t count;  // leaf: slot numbers listed
-  uint8_t dim;     // FW_CLS_LEAF for a leaf
-  uint8_t shift;   // child = (value >> shift) & mask
+  uint8_t word;    // key word read (FWClsKey); FW_CLS_LEAF for a leaf
+  uint8_t shift;   // child = (word >> shift) & mask
   uint16_t mask;
 };
 static_assert(sizeof(FWClsNode) == 12);
@@ -100,10 +100,17 @@ struct FWRuleEntry;
                                           FWClassifier** classifier);
 void FWClassifierFree(FWClassifier** classifier);
 
-// The packet's value on every dimension.
+// The packet's values on every dimension, packed as in the scan index's
+// key words (fw_index.h) so that an IPv4 packet's words serve as they are:
+// word 0 holds the ports (numeric) in bits 0-31 and the protocol in 32-39,
+// word 1 the destination address in bits 0-31 and the source in 32-63.
+// Other bits of word 0 are never read: a node's field stays inside its
+// dimension.
 struct FWClsKey {
-  uint32_t v[FW_CLS_DIMS];
+  uint64_t w[2];
 };
+inline constexpr uint8_t kFWClsDimWord[FW_CLS_DIMS] = {1, 1, 0, 0, 0};
+inline constexpr uint8_t kFWClsDimShift[FW_CLS_DIMS] = {32, 0, 16, 0, 32};
 
 // The leaf of `key` in the tree rooted at node `root`: its first slot
 // number and count.
@@ -111,8 +118,8 @@ inline const uint32_t* FWClassifierLeaf(const FWClassifier* c, uint32_t root,
                                         const FWClsKey& key, uint32_t* count) {
   const FWClsNode* nodes = c->nodes;
   const FWClsNode* n = nodes + root;
-  while (n->dim != FW_CLS_LEAF) {
-    n = &nodes[n->base + ((key.v[n->dim] >> n->shift) & n->mask)];
+  while (n->word != FW_CLS_LEAF) {
+    n = &nodes[n->base + ((key.w[n->word] >> n->shift) & n->mask)];
   }
   *count = n->count;
   return c->leaves + n->base;

@@ -40,12 +40,12 @@ struct SlotBuilder {
     value[word] |= fieldValue & fieldMask;
   }
 
-  // An IPv4 address as stored, at `shift` of word 1: equal, or within the
+  // An IPv4 address, numeric, at `shift` of word 1: equal, or within the
   // common prefix of an inclusive range [lo, hi]. An empty range (lo > hi)
   // is left to the full test.
   void V4Address(const uint8_t* lo, const uint8_t* hi, bool range, uint32_t shift) {
     if (!range) {
-      Require(1, 0xffffffffull << shift, static_cast<uint64_t>(FWLoad32(lo)) << shift);
+      Require(1, 0xffffffffull << shift, static_cast<uint64_t>(FWNet32(lo)) << shift);
       return;
     }
     const uint32_t l = FWNet32(lo), h = FWNet32(hi);
@@ -56,16 +56,15 @@ struct SlotBuilder {
     const uint32_t prefix = CommonPrefix32(l, h);
     // A range that is exactly a prefix is exactly its masked equality.
     if ((l & ~prefix) != 0 || (h | prefix) != 0xffffffffu) exact = false;
-    Require(1, static_cast<uint64_t>(__builtin_bswap32(prefix)) << shift,
-            static_cast<uint64_t>(__builtin_bswap32(l & prefix)) << shift);
+    Require(1, static_cast<uint64_t>(prefix) << shift, static_cast<uint64_t>(l & prefix) << shift);
   }
 
-  // A port as stored, at `shift` of word 0; a range as for IPv4, which
+  // A port, numeric, at `shift` of word 0; a range as for IPv4, which
   // when it is not a prefix also goes to `ranges` (`*lo`, `*hi`).
   void Port(const uint8_t* lo, const uint8_t* hi, bool range, uint32_t shift, uint16_t* rangeLo,
             uint16_t* rangeHi) {
     if (!range) {
-      Require(0, 0xffffull << shift, static_cast<uint64_t>(FWLoad16(lo)) << shift);
+      Require(0, 0xffffull << shift, static_cast<uint64_t>(FWNet16(lo)) << shift);
       return;
     }
     const uint32_t l = FWNet16(lo), h = FWNet16(hi);
@@ -79,9 +78,7 @@ struct SlotBuilder {
       *rangeLo = static_cast<uint16_t>(l);
       *rangeHi = static_cast<uint16_t>(h);
     }
-    Require(0, static_cast<uint64_t>(__builtin_bswap16(static_cast<uint16_t>(prefix))) << shift,
-            static_cast<uint64_t>(__builtin_bswap16(static_cast<uint16_t>(l & prefix)))
-                << shift);
+    Require(0, static_cast<uint64_t>(prefix) << shift, static_cast<uint64_t>(l & prefix) << shift);
   }
 };
 
@@ -140,8 +137,9 @@ void SlotFromRule(const FWRule& r, FWScanSlot* slot, FWPortRanges* ranges) {
       const uint8_t *lo, *hi;
       uint32_t shift;
     };
-    const Addr addrs[2] = {{FW_WC_IPSA, FW_NEG_IPSA, FW_RANGE_IPSA, r.ipSa, r.ipSaHigh, 0},
-                           {FW_WC_IPDA, FW_NEG_IPDA, FW_RANGE_IPDA, r.ipDa, r.ipDaHigh, 32}};
+    const Addr addrs[2] = {
+        {FW_WC_IPSA, FW_NEG_IPSA, FW_RANGE_IPSA, r.ipSa, r.ipSaHigh, FW_KEY1_SA_SHIFT},
+        {FW_WC_IPDA, FW_NEG_IPDA, FW_RANGE_IPDA, r.ipDa, r.ipDaHigh, FW_KEY1_DA_SHIFT}};
     for (const Addr& a : addrs) {
       if (!compared(a.wildcard, a.negate)) continue;
       if (v4) {

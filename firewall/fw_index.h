@@ -10,7 +10,8 @@
 //   - presence (every field the rule compares), direction, address family;
 //   - MACs (with their masks), ethertype, protocol, IPv4 addresses and
 //     ports compared for equality, and IPv4 or port ranges that are
-//     exactly a prefix;
+//     exactly a prefix (both in numeric order, as the classifier's trees
+//     read them from the same words);
 //   - a necessary condition for the rest: the common leading bits of any
 //     other IPv4 or port range, a 16-bit fold of the 802.1Q tag, 32-bit folds of
 //     IPv6 addresses.
@@ -55,21 +56,29 @@ struct FWScanIndex {
   bool l2Words;            // some slot masks key word 2 or 3; else the scan skips both
 };
 
-// Key word 0: ports and protocol as stored, presence bits 0-9, the family
-// and direction bits, and two bits that only rules use.
-inline constexpr uint32_t FW_KEY0_DPORT_SHIFT = 0;   // 16 bits, as stored
-inline constexpr uint32_t FW_KEY0_SPORT_SHIFT = 16;  // 16 bits, as stored
+// Key word 0: ports (numeric) and protocol, presence bits 0-9, the family
+// and direction bits, and two bits that only rules use. Ports and protocol
+// sit as a big-endian load of the summary's ipProto, sPort, dPort puts
+// them, so the packet's side is one load, one swap and one shift.
+inline constexpr uint32_t FW_KEY0_DPORT_SHIFT = 0;   // 16 bits, numeric
+inline constexpr uint32_t FW_KEY0_SPORT_SHIFT = 16;  // 16 bits, numeric
 inline constexpr uint32_t FW_KEY0_PROTO_SHIFT = 32;  // 8 bits
 inline constexpr uint32_t FW_KEY0_PRESENCE_SHIFT = 40;  // presence bits 0-9
+inline constexpr uint32_t FW_KEY0_FAMILY_SHIFT = 50;
 inline constexpr uint64_t FW_KEY0_FAMILY_V4 = 1ull << 50;  // IPv4 packet, or not IP
 inline constexpr uint64_t FW_KEY0_FAMILY_V6 = 1ull << 51;  // IPv6 packet, or not IP
+inline constexpr uint32_t FW_KEY0_DIR_SHIFT = 51;          // direction d sets bit 51 + d
 inline constexpr uint64_t FW_KEY0_DIR_FROM = 1ull << 52;   // direction 1
 inline constexpr uint64_t FW_KEY0_DIR_TO = 1ull << 53;     // direction 2
+static_assert(FW_KEY0_DIR_FROM == 1ull << (FW_KEY0_DIR_SHIFT + SLCGenericDirectionFromSwitch));
+static_assert(FW_KEY0_DIR_TO == 1ull << (FW_KEY0_DIR_SHIFT + SLCGenericDirectionToSwitch));
 inline constexpr uint64_t FW_KEY0_PORT_RANGES = 1ull << 61;  // value only: exact once ranges hold
 inline constexpr uint64_t FW_KEY0_NEVER = 1ull << 62;      // never set in a packet key
 inline constexpr uint64_t FW_KEY0_EXACT = 1ull << 63;      // value only, outside every mask
-// Key word 1: source address in bits 0-31, destination in 32-63; IPv4 as
-// stored, IPv6 folded (FWFold32).
+// Key word 1: destination address in bits 0-31, source in 32-63; IPv4
+// numeric, IPv6 folded as stored (FWFold32).
+inline constexpr uint32_t FW_KEY1_DA_SHIFT = 0;
+inline constexpr uint32_t FW_KEY1_SA_SHIFT = 32;
 // Key word 2: dMac (zero-extended, as stored) in bits 0-47, ethertype as
 // stored in 48-63.
 // Key word 3: sMac in bits 0-47, the 802.1Q tag folded (FWFold16) in 48-63.

@@ -227,33 +227,72 @@ __attribute__((noinline)) bool FWRuleMatches(const FWRule& r, FWScan* s) {
   return true;
 }
 
-// The packet's key words (fw_index.h), read from the summary with the
-// same loads as FWDecode. Direction 1 or 2 only.
+// A scan's state for the full test, set up on its first use: most packets
+// are decided by their slots alone.
+inline void FWScanStart(FWScan* s, const FWPktSummary* summary, uint32_t direction, ZelPkt* pkt) {
+  s->summary = summary;
+  s->presence = summary->presence;
+  s->direction = direction;
+  s->v4 = (s->presence & FW_PKT_IPV4) != 0;
+  s->v6 = !s->v4 && (s->presence & FW_PKT_IPV6) != 0;
+  s->ports = (s->presence & FW_PKT_PORTS) != 0;
+  s->decoded = false;
+  s->haveTag = false;
+  s->tag = 0;
+  s->pkt = pkt;
+}
+
+// The packet's key words (fw_index.h) and the classifier's (fw_classifier.h),
+// read from the summary. Direction 1 or 2 only.
 struct FWPacketKey {
   uint64_t k0, k1, k2, k3;
+  FWClsKey cls;
 };
 
-inline uint64_t KeyAddress(const uint8_t* a, bool v4) {
-  return v4 ? FWLoad32(a) : FWFold32(FWLoad64(a), FWLoad64(a + 8));
-}
+// Key word 0's family bits by the presence bits FW_PKT_IPV4 and
+// FW_PKT_IPV6: a packet flagged as both counts as IPv4, as in FWScan.
+constexpr uint8_t kFamilyBits[4] = {3, 1, 2, 1};
+static_assert(FW_PKT_IPV6 == FW_PKT_IPV4 << 1);
+static_assert(FW_KEY0_FAMILY_V4 == 1ull << FW_KEY0_FAMILY_SHIFT &&
+              FW_KEY0_FAMILY_V6 == 2ull << FW_KEY0_FAMILY_SHIFT);
+static_assert(FW_KEY0_FAMILY_SHIFT == FW_KEY0_PRESENCE_SHIFT + 10 && FW_WC_ALL == 0x3ffu);
+// Protocol and ports come from one 8-byte load at ipProto: the three bytes
+// past dPort are the summary's own padding, shifted out.
+static_assert(offsetof(FWPktSummary, sPort) == offsetof(FWPktSummary, ipProto) + 1 &&
+              offsetof(FWPktSummary, dPort) == offsetof(FWPktSummary, ipProto) + 3 &&
+              offsetof(FWPktSummary, ipProto) + 8 <= sizeof(FWPktSummary));
+static_assert(FW_KEY0_DPORT_SHIFT == 0 && FW_KEY0_SPORT_SHIFT == 16 && FW_KEY0_PROTO_SHIFT == 32);
 
 // Words 2 and 3 (MACs, ethertype, 802.1Q tag) only with kL2: an index
 // none of whose slots compares them leaves them 0.
 template <bool kL2>
-inline FWPacketKey PacketKey(const FWScan& s) {
-  const FWPktSummary* summary = s.summary;
-  const uint32_t presence = s.presence;
+inline FWPacketKey PacketKey(const FWPktSummary* summary, uint32_t presence, uint32_t direction) {
   FWPacketKey k;
-  k.k0 = (static_cast<uint64_t>(FWLoad16(summary->dPort)) << FW_KEY0_DPORT_SHIFT) |
-         (static_cast<uint64_t>(FWLoad16(summary->sPort)) << FW_KEY0_SPORT_SHIFT) |
-         (static_cast<uint64_t>(summary->ipProto) << FW_KEY0_PROTO_SHIFT) |
-         (static_cast<uint64_t>(presence & FW_WC_ALL) << FW_KEY0_PRESENCE_SHIFT) |
-         (s.v6 ? 0 : FW_KEY0_FAMILY_V4) | (s.v4 ? 0 : FW_KEY0_FAMILY_V6) |
-         (s.direction == SLCGenericDirectionFromSwitch ? FW_KEY0_DIR_FROM : FW_KEY0_DIR_TO);
+  const uint32_t ip = (presence / FW_PKT_IPV4) & 3;
+  k.k0 = (__builtin_bswap64(FWLoad64(&summary->ipProto)) >> 24) |
+         (static_cast<uint64_t>((presence & FW_WC_ALL) | (kFamilyBits[ip] << 10u))
+          << FW_KEY0_PRESENCE_SHIFT) |
+         (uint64_t{1} << (FW_KEY0_DIR_SHIFT + direction));
   k.k1 = 0;
-  if (s.v4 || s.v6) {
-    if (presence & FW_WC_IPSA) k.k1 = KeyAddress(summary->ipSa, s.v4);
-    if (presence & FW_WC_IPDA) k.k1 |= KeyAddress(summary->ipDa, s.v4) << 32;
+  k.cls.w[0] = k.k0;
+  if (ip & 1) {  // IPv4: the classifier reads the same word
+    if (presence & FW_WC_IPSA) k.k1 = static_cast<uint64_t>(FWNet32(summary->ipSa)) << FW_KEY1_SA_SHIFT;
+    if (presence & FW_WC_IPDA) k.k1 |= static_cast<uint64_t>(FWNet32(summary->ipDa)) << FW_KEY1_DA_SHIFT;
+    k.cls.w[1] = k.k1;
+  } else if (ip & 2) {  // IPv6: folded for the slots, leading 32 bits for the classifier
+    k.cls.w[1] = 0;
+    if (presence & FW_WC_IPSA) {
+      const uint8_t* a = summary->ipSa;
+      k.k1 = FWFold32(FWLoad64(a), FWLoad64(a + 8)) << FW_KEY1_SA_SHIFT;
+      k.cls.w[1] = static_cast<uint64_t>(FWNet32(a)) << FW_KEY1_SA_SHIFT;
+    }
+    if (presence & FW_WC_IPDA) {
+      const uint8_t* a = summary->ipDa;
+      k.k1 |= FWFold32(FWLoad64(a), FWLoad64(a + 8)) << FW_KEY1_DA_SHIFT;
+      k.cls.w[1] |= static_cast<uint64_t>(FWNet32(a)) << FW_KEY1_DA_SHIFT;
+    }
+  } else {
+    k.cls.w[1] = 0;
   }
   k.k2 = k.k3 = 0;
   if (kL2) {
@@ -265,33 +304,17 @@ inline FWPacketKey PacketKey(const FWScan& s) {
   return k;
 }
 
-// The packet's value on each classifier dimension (fw_classifier.h), from
-// its key words where they hold it as stored: IPv4 addresses (0 when
-// absent), ports and protocol (whatever the summary holds when absent).
-// IPv6 addresses are folded there, so their leading word is loaded again.
-inline FWClsKey ClassifierKey(const FWScan& s, const FWPacketKey& k) {
-  FWClsKey key;
-  if (s.v6) {
-    key.v[0] = (s.presence & FW_WC_IPSA) ? FWNet32(s.summary->ipSa) : 0;
-    key.v[1] = (s.presence & FW_WC_IPDA) ? FWNet32(s.summary->ipDa) : 0;
-  } else {
-    key.v[0] = __builtin_bswap32(static_cast<uint32_t>(k.k1));
-    key.v[1] = __builtin_bswap32(static_cast<uint32_t>(k.k1 >> 32));
-  }
-  key.v[2] = __builtin_bswap16(static_cast<uint16_t>(k.k0 >> FW_KEY0_SPORT_SHIFT));
-  key.v[3] = __builtin_bswap16(static_cast<uint16_t>(k.k0 >> FW_KEY0_DPORT_SHIFT));
-  key.v[4] = static_cast<uint8_t>(k.k0 >> FW_KEY0_PROTO_SHIFT);
-  return key;
-}
-
 // The keyed lookup: slots tested by their masked words (and the full test
 // when a slot says so), through the classifier when there is one.
 template <bool kL2>
-FWRuleEntry* FWFindKeyed(const FWScanIndex* index, FWScan& s) {
+FWRuleEntry* FWFindKeyed(const FWScanIndex* index, const FWPktSummary* summary,
+                         uint32_t presence, uint32_t direction, ZelPkt* pkt) {
   const uint32_t count = index->count;
   FWRuleEntry* const* entries = index->entries;
-  const FWPacketKey k = PacketKey<kL2>(s);
+  const FWPacketKey k = PacketKey<kL2>(summary, presence, direction);
   const FWScanSlot* const slots = index->slots;
+  FWScan s;
+  bool started = false;
   auto miss = [&k](const FWScanSlot& slot) {
     uint64_t m = ((k.k0 ^ slot.value[0]) & slot.mask[0]) | ((k.k1 ^ slot.value[1]) & slot.mask[1]);
     if (kL2) {
@@ -304,10 +327,14 @@ FWRuleEntry* FWFindKeyed(const FWScanIndex* index, FWScan& s) {
     if (v0 & FW_KEY0_EXACT) return true;
     if (v0 & FW_KEY0_PORT_RANGES) {
       const FWPortRanges& r = index->ranges[i];
-      const uint32_t sp = __builtin_bswap16(static_cast<uint16_t>(k.k0 >> FW_KEY0_SPORT_SHIFT));
-      const uint32_t dp = __builtin_bswap16(static_cast<uint16_t>(k.k0 >> FW_KEY0_DPORT_SHIFT));
+      const uint32_t sp = static_cast<uint16_t>(k.k0 >> FW_KEY0_SPORT_SHIFT);
+      const uint32_t dp = static_cast<uint16_t>(k.k0 >> FW_KEY0_DPORT_SHIFT);
       return sp - r.sLo <= static_cast<uint32_t>(r.sHi - r.sLo) &&
              dp - r.dLo <= static_cast<uint32_t>(r.dHi - r.dLo);
+    }
+    if (!started) {
+      FWScanStart(&s, summary, direction, pkt);
+      started = true;
     }
     return FWRuleMatches(entries[i]->rule, &s);
   };
@@ -317,7 +344,7 @@ FWRuleEntry* FWFindKeyed(const FWScanIndex* index, FWScan& s) {
     // slot order: the first slot that passes its test is the first match
     // of the whole scan, reached through the same full tests. A slot is
     // in one list only.
-    const FWClsKey key = ClassifierKey(s, k);
+    const FWClsKey& key = k.cls;
     if (cls->numTrees == 1 && cls->numResidual == 0) {  // one leaf: nothing to merge
       uint32_t n;
       const uint32_t* leaf = FWClassifierLeaf(cls, cls->roots[0], key, &n);
@@ -397,33 +424,24 @@ FWRuleEntry* FWFindRuleForPacket(SLCGenericFilter* filter, ZelPkt* pkt, uint32_t
                                  const FWPktSummary* summary) {
   const FWScanIndex* index = FWContext(filter)->scanIndex;
   if (index == nullptr || index->count == 0) return nullptr;
-
-  FWScan s;  // s.p is filled by FWDecode on first use
-  s.summary = summary;
-  s.presence = summary->presence;
-  s.direction = direction;
-  s.v4 = (s.presence & FW_PKT_IPV4) != 0;
-  s.v6 = !s.v4 && (s.presence & FW_PKT_IPV6) != 0;
-  s.ports = (s.presence & FW_PKT_PORTS) != 0;
-  s.decoded = false;
-  s.haveTag = false;
-  s.tag = 0;
-  s.pkt = pkt;
-
-  const uint32_t count = index->count;
-  FWRuleEntry* const* entries = index->entries;
+  const uint32_t presence = summary->presence;
 
   // The key words encode directions 1 and 2 only, and addresses only of
   // IPv4 and IPv6 packets; any other packet gets the full test of every
   // rule.
   const bool keyed = (direction == SLCGenericDirectionFromSwitch ||
                       direction == SLCGenericDirectionToSwitch) &&
-                     (s.v4 || s.v6 || (s.presence & (FW_WC_IPSA | FW_WC_IPDA)) == 0);
+                     ((presence & (FW_PKT_IPV4 | FW_PKT_IPV6)) != 0 ||
+                      (presence & (FW_WC_IPSA | FW_WC_IPDA)) == 0);
   if (__builtin_expect(!keyed, 0)) {
-    for (uint32_t i = 0; i < count; i++) {
+    FWScan s;
+    FWScanStart(&s, summary, direction, pkt);
+    FWRuleEntry* const* entries = index->entries;
+    for (uint32_t i = 0; i < index->count; i++) {
       if (entries[i] != nullptr && FWRuleMatches(entries[i]->rule, &s)) return entries[i];
     }
     return nullptr;
   }
-  return index->l2Words ? FWFindKeyed<true>(index, s) : FWFindKeyed<false>(index, s);
+  return index->l2Words ? FWFindKeyed<true>(index, summary, presence, direction, pkt)
+                        : FWFindKeyed<false>(index, summary, presence, direction, pkt);
 }
