@@ -10,12 +10,8 @@
 FWClassifierTuning g_fwClassifierTuning = kFWClassifierDefaults;
 
 namespace {
-
 constexpr uint32_t kDimBits[FW_CLS_DIMS] = {32, 32, 16, 16, 8};
 constexpr uint32_t kMaxCutBits = 8;
-// A node may copy its rules into its children at most this many times over
-// (children counted too), so that one cut never multiplies memory.
-constexpr uint64_t kSpaceFactor = 4;
 // Lists longer than this choose their cut on a sample of this many rules.
 constexpr uint32_t kSampleRules = 1024;
 // A node costs three leaf entries (12 bytes against 4).
@@ -249,7 +245,7 @@ struct Builder {
       for (uint32_t bits = 1; bits <= maxBits; bits++) {
         uint64_t largest, copies;
         Evaluate(sampled, count, bits, maxBits - bits, &largest, &copies);
-        if (copies + (1u << bits) > kSpaceFactor * count && bits > 1) break;
+        if (copies + (1u << bits) > uint64_t{t.spaceFactor} * count && bits > 1) break;
         if (largest < bestLargest || (largest == bestLargest && bestDim != FW_CLS_DIMS &&
                                       copies < bestCopies)) {
           bestDim = d;
@@ -261,38 +257,48 @@ struct Builder {
     }
     if (bestDim == FW_CLS_DIMS) return MakeLeaf(node, off, count);
     const uint32_t d = bestDim;
-    const uint32_t children = 1u << bestBits;
 
     // Each child's rules, counted exactly: the starts of the children's
-    // lists (relative to `fill`) go on the offsets stack.
+    // lists (relative to `fill`) go on the offsets stack. Only a cut whose
+    // every child holds fewer rules than this node is taken (sibling
+    // subtrees are shared on that ground, below), within the space factor
+    // and the budget. The sample may have misjudged the cut: coarser cuts
+    // of the same dimension are tried before the node gives up.
     const uint32_t at = offsets.size;
-    if (!offsets.Reserve(uint64_t{at} + children + 1)) return false;
+    if (!offsets.Reserve(uint64_t{at} + (1u << bestBits) + 1)) return false;
     uint32_t* c = counts.data;
-    zel_Memset(c, 0, (children + 1) * sizeof(uint32_t));
+    uint32_t children = 0;
     uint64_t copies = 0;
-    for (uint32_t k = 0; k < count; k++) {
-      uint32_t first, last;
-      ChildSpan(scratch.data[off + k], reg, d, bestBits, &first, &last);
-      c[first]++;
-      c[last + 1]--;
-      copies += last - first + 1;
+    for (;; bestBits--) {
+      children = 1u << bestBits;
+      zel_Memset(c, 0, (children + 1) * sizeof(uint32_t));
+      copies = 0;
+      for (uint32_t k = 0; k < count; k++) {
+        uint32_t first, last;
+        ChildSpan(scratch.data[off + k], reg, d, bestBits, &first, &last);
+        c[first]++;
+        c[last + 1]--;
+        copies += last - first + 1;
+      }
+      uint32_t running = 0, largest = 0;
+      for (uint32_t j = 0; j < children; j++) {
+        running += c[j];
+        if (running > largest) largest = running;
+      }
+      if (largest < count && (copies + children <= uint64_t{t.spaceFactor} * count || bestBits == 1) &&
+          children * kNodeCost + copies <= budget) {
+        break;
+      }
+      if (bestBits == 1) return MakeLeaf(node, off, count);
     }
-    uint32_t running = 0, largest = 0, start = 0;
+    uint32_t running = 0, start = 0;
     for (uint32_t j = 0; j < children; j++) {
       running += c[j];
-      if (running > largest) largest = running;
       offsets.data[at + j] = start;
       c[j] = start;  // from here on, where child j's next rule goes
       start += running;
     }
     offsets.data[at + children] = start;
-    // Only a cut whose every child holds fewer rules than this node is
-    // taken (sibling subtrees are shared on that ground, below), within
-    // the space factor and the budget.
-    if (largest >= count || (copies + children > kSpaceFactor * count && bestBits > 1) ||
-        children * kNodeCost + copies > budget) {
-      return MakeLeaf(node, off, count);
-    }
     const uint64_t share = budget - children * kNodeCost;
     const uint32_t fill = scratch.size;
     if (!scratch.Reserve(uint64_t{fill} + copies) || !nodes.Reserve(uint64_t{nodes.size} + children)) {

@@ -72,12 +72,14 @@ struct FWClassifier {
 // node with at most leafSize rules is a leaf (smallLeafSize, when not 0,
 // for rulesets of at most smallRules rules: finer leaves test fewer
 // candidates per packet, and only small rulesets build them fast enough);
-// the tree holds at most budgetPerRule 4-byte words (leaf entries; a node
-// takes three) per rule. Rulesets of at most oneTreeRules rules put every
-// rule the trees take in one tree: a lookup then descends once and merges
-// nothing (but the residual list), and the copies of rules wide on the
-// dimension cut stay affordable. Tests lower them to exercise deep trees
-// on small rulesets.
+// a cut may copy a node's rules into its children at most spaceFactor
+// times over (children counted too), so that one cut never multiplies
+// memory; the tree holds at most budgetPerRule 4-byte words (leaf
+// entries; a node takes three) per rule. Rulesets of at most oneTreeRules
+// rules put every rule the trees take in one tree: a lookup then descends
+// once and merges nothing (but the residual list), and the copies of rules
+// wide on the dimension cut stay affordable. Tests lower them to exercise
+// deep trees on small rulesets.
 struct FWClassifierTuning {
   uint32_t minRules;
   uint32_t leafSize;
@@ -86,9 +88,10 @@ struct FWClassifierTuning {
   uint32_t smallLeafSize;
   uint32_t smallRules;
   uint32_t oneTreeRules;
+  uint32_t spaceFactor;
 };
 extern FWClassifierTuning g_fwClassifierTuning;
-inline constexpr FWClassifierTuning kFWClassifierDefaults = {24, 16, 24, 256, 4, 4096, 16384};
+inline constexpr FWClassifierTuning kFWClassifierDefaults = {24, 16, 24, 256, 4, 4096, 16384, 16};
 
 struct FWScanSlot;
 struct FWRuleEntry;

@@ -268,7 +268,8 @@ TEST_F(ClassifierTest, SameRuleAsTheOrderedScanForEveryPacket) {
     // Leaves of 1 to 8 rules, now and then a budget that stops the cutting
     // early; one tree or a tree per separating field.
     g_fwClassifierTuning = {1, 1 + gen.U(8), 1 + gen.U(24), gen.P(20) ? 1u + gen.U(4) : 64u,
-                            gen.P(30) ? 1u + gen.U(4) : 0u, 150, gen.P(50) ? 1000u : 0u};
+                            gen.P(30) ? 1u + gen.U(4) : 0u, 150, gen.P(50) ? 1000u : 0u,
+                            gen.P(50) ? 2u + gen.U(3) : 16u};
     // Now and then no rule compares an L2 field, so the lookup leaves the
     // L2 key words out.
     gen.l2Percent = gen.P(30) ? 0 : 10;
@@ -334,7 +335,7 @@ TEST_F(ClassifierTest, SameRuleAsTheOrderedScanForEveryPacket) {
 // often hold the same rules (and share a subtree): every cut boundary and
 // every range end is met, which packets drawn at random seldom do.
 TEST_F(ClassifierTest, EveryDestinationPortAgainstTheOrderedScan) {
-  g_fwClassifierTuning = {1, 1, 24, 256, 0, 0, 0};
+  g_fwClassifierTuning = {1, 1, 24, 256, 0, 0, 0, 4};
   uint64_t differing = 0;
   for (uint32_t seed = 0; seed < 12; seed++) {
     Gen gen(0x9047u + seed);
@@ -396,6 +397,32 @@ TEST_F(ClassifierTest, DefaultLimitsOnThousandsOfRules) {
   }
 }
 
+// Cuts of large lists are chosen on a sample. Here the sample (every other
+// rule) sees only single addresses, while the rules between them each span
+// a quarter of the destination space: the finest cut the sample suggests
+// copies far too much, and a coarser cut must be taken instead of leaving
+// all the rules in one leaf, which would be a scan of the whole list.
+TEST_F(ClassifierTest, ACutTheSampleMisjudgedGivesWayToACoarserOne) {
+  rules::RulesetBuilder b(8);
+  for (uint32_t i = 0; i < 2048; i++) {
+    if (i % 2 == 0) {
+      b.Add(fmt::format("action=drop ipv4 ethtype=any da={}.{}.0.1 pkts={}", i / 8, i % 8, i + 1));
+    } else {
+      b.Add(fmt::format("action=drop ipv4 ethtype=any proto=udp dport={} da={}.0.0.0/2 pkts={}",
+                        i, (i % 4) * 64, i + 1));
+    }
+  }
+  const auto rs = b.Bytes();
+  ASSERT_EQ(Apply(rs, true), ZEL_OK);
+  const FWClassifier* cls = ctx_->scanIndex->classifier;
+  ASSERT_NE(cls, nullptr);
+  ASSERT_GT(cls->numNodes, 1u) << "the root stayed a leaf of every rule";
+  FwModel model;
+  model.Apply(rs, true);
+  Gen gen(0x5a3b1e);
+  ExpectSameAsModel(gen, model, 0, 2000);
+}
+
 // An allocation failed anywhere in building a new ruleset (records, table,
 // index, the classifier's blocks and growing arrays) undoes the whole
 // application on every road, in replace and in add mode: the filter as it
@@ -428,7 +455,7 @@ TEST_F(ClassifierTest, AllocationFailureAnywhereInTheBuildChangesNothing) {
        }},
   };
   for (const Road& road : roads) {
-    g_fwClassifierTuning = {1, 2, 24, 64, 0, 0, road.oneTreeRules};
+    g_fwClassifierTuning = {1, 2, 24, 64, 0, 0, road.oneTreeRules, 4};
     ASSERT_EQ(Apply(first.Bytes(), true, road.fromIoctl), ZEL_OK) << road.name;
     const uint64_t heapBlocks = Capture().heapBlocks;
     const uint64_t failures = FailEachAllocation(road.name, [&] {
