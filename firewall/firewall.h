@@ -16,12 +16,19 @@
 struct FWRuleEntry {
   ListLinks link;              // first: the host table expects it at offset 0
   uint32_t hash;               // low 32 bits of the tuple hash (exact rules)
+  // rule.direction, beside the hash (exact rules): a hit then reads only
+  // the entry's first two cache lines (links, hash, action, match fields,
+  // counters), where rule.direction sits in the third. Set with the hash
+  // and wherever rule.direction changes.
+  uint8_t direction;
   FWRule rule;                 // version-8 form, counters included
   ZelSocket greSocket;
   uint8_t greSocketOpen;       // 1 once greSocket is open
   uint16_t poolTag;            // resource-pool tag of action 8, else 0
 };
 static_assert(offsetof(FWRuleEntry, link) == 0);
+static_assert(offsetof(FWRuleEntry, rule) + offsetof(FWRule, byteCount) + 8 <= 128,
+              "an exact hit reads two cache lines");
 
 // The general rules' scan index (fw_index.h).
 struct FWScanIndex;

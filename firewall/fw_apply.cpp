@@ -160,6 +160,7 @@ bool FWInstallRecord(SLCGenericFilter* filter, FWFilterContext* ctx, const FWRul
       return false;
     }
     zel_Memcpy(&entry->rule, work, sizeof(FWRule));
+    entry->direction = work->direction;
     FWAssignPoolTag(entry, &tag);
     // Front insertion; scans run from the back, so ruleset order holds.
     List_InsertAfter(&entry->link, &ctx->ruleList);
@@ -405,6 +406,7 @@ bool FWIterStageCopy(void* elem, void* arg) {
   auto* copy = static_cast<FWRuleEntry*>(SLCGenericAlloc(sizeof(FWRuleEntry)));
   if (copy == nullptr) return false;
   copy->hash = from->hash;
+  copy->direction = from->direction;
   auto* to = reinterpret_cast<uint8_t*>(&copy->rule);
   const auto* src = reinterpret_cast<const uint8_t*>(&from->rule);
   zel_Memcpy(to, src, kCountersAt);

@@ -83,6 +83,7 @@ ZelStatus FWInsertRuleInHashTable(SLCGenericFilter* filter, FWFilterContext* ctx
       }
     } else {
       existing->rule.direction = static_cast<uint8_t>(existing->rule.direction | rule->direction);
+      existing->direction = existing->rule.direction;
     }
     return ZEL_OK;
   }
@@ -94,6 +95,7 @@ ZelStatus FWInsertRuleInHashTable(SLCGenericFilter* filter, FWFilterContext* ctx
     return ZEL_FAILURE;
   }
   entry->hash = static_cast<uint32_t>(hash);
+  entry->direction = rule->direction;
   zel_Memcpy(&entry->rule, rule, sizeof(FWRule));
   FWHashLinkEntry(ctx->ruleHash, entry);
   ctx->numRules++;

@@ -428,13 +428,12 @@ __attribute__((always_inline)) inline void FWParseInto(ZelPkt* pkt, FWParsedPkt*
   }
 }
 
-// The three cache lines of a rule entry the exact probe reads: links and
-// hash, match fields and counters, direction.
+// The two cache lines of a rule entry the exact probe reads: links, hash,
+// direction and action; match fields and counters.
 __attribute__((always_inline)) inline void FWPrefetchLines(const ListLinks* link) {
   const char* e = reinterpret_cast<const char*>(link);
   __builtin_prefetch(e);
   __builtin_prefetch(e + 64);
-  __builtin_prefetch(e + 128);
 }
 
 // The first rule entry the exact probe will compare: its bucket's oldest.

@@ -90,7 +90,7 @@ FWRuleEntry* FWHashFindEntry(const Hash_Table* table, const FWRuleTuple* tuple, 
 inline FWRuleEntry* FWExactAccepts(FWRuleEntry* entry, uint32_t direction, ZelPkt* pkt) {
   if (entry == nullptr) return nullptr;
   const FWRule& rule = entry->rule;
-  if (rule.direction != SLCGenericDirectionBidirectional && rule.direction != direction) {
+  if (entry->direction != SLCGenericDirectionBidirectional && entry->direction != direction) {
     return nullptr;
   }
   if (!(rule.ruleFlags & FW_WC_RPTAG)) {
