@@ -91,7 +91,7 @@ struct FWClassifierTuning {
   uint32_t spaceFactor;
 };
 extern FWClassifierTuning g_fwClassifierTuning;
-inline constexpr FWClassifierTuning kFWClassifierDefaults = {24, 16, 24, 256, 4, 4096, 16384, 16};
+inline constexpr FWClassifierTuning kFWClassifierDefaults = {24, 16, 24, 256, 4, 4096, 16384, 12};
 
 struct FWScanSlot;
 struct FWRuleEntry;
