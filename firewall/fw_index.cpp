@@ -223,6 +223,19 @@ ZelStatus FWScanIndexBuild(const ListLinks* ruleList, FWScanIndex** index,
     }
   }
   idx->count = i;
+  idx->halfSlots = nullptr;
+  if (!idx->l2Words) {
+    // Words 0 and 1 of each slot, moved to the front of the storage; slot
+    // i's half lands at or below where slot i starts, so in order nothing
+    // is overwritten before it is read.
+    auto* half = reinterpret_cast<FWScanHalfSlot*>(idx->slots);
+    for (uint32_t k = 0; k < idx->count; k++) {
+      const FWScanSlot slot = idx->slots[k];
+      half[k] = FWScanHalfSlot{{slot.value[0], slot.value[1]}, {slot.mask[0], slot.mask[1]}};
+    }
+    idx->halfSlots = half;
+    idx->slots = nullptr;
+  }
   idx->classifier = nullptr;
   if (FWClassifierBuild(idx->entries, idx->count, &idx->classifier) != ZEL_OK) {
     SLCGenericFree(block);
@@ -246,16 +259,21 @@ void FWScanIndexForget(FWScanIndex* index, const FWRuleEntry* entry) {
   for (uint32_t i = 0; i < index->count; i++) {
     if (index->entries[i] != entry) continue;
     if (index->classifier != nullptr) {
-      FWScanSlot& slot = index->slots[i];
-      slot = FWScanSlot{};
-      slot.value[0] = FW_KEY0_NEVER;
-      slot.mask[0] = FW_KEY0_NEVER;
+      if (index->halfSlots != nullptr) {
+        index->halfSlots[i] = FWScanHalfSlot{{FW_KEY0_NEVER, 0}, {FW_KEY0_NEVER, 0}};
+      } else {
+        index->slots[i] = FWScanSlot{{FW_KEY0_NEVER, 0, 0, 0}, {FW_KEY0_NEVER, 0, 0, 0}};
+      }
       index->entries[i] = nullptr;
       return;
     }
     // Compact in place, front to back, keeping ruleset order.
     for (uint32_t j = i + 1; j < index->count; j++) {
-      index->slots[j - 1] = index->slots[j];
+      if (index->halfSlots != nullptr) {
+        index->halfSlots[j - 1] = index->halfSlots[j];
+      } else {
+        index->slots[j - 1] = index->slots[j];
+      }
       index->entries[j - 1] = index->entries[j];
       index->ranges[j - 1] = index->ranges[j];
     }

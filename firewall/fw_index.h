@@ -39,6 +39,15 @@ struct FWScanSlot {
 };
 static_assert(sizeof(FWScanSlot) == 64, "one cache line per rule");
 
+// A slot of an index none of whose slots compares key words 2 and 3: words
+// 0 and 1 only, two slots to a cache line, so that the slots a lookup
+// reads are half as likely to have left the caches.
+struct FWScanHalfSlot {
+  uint64_t value[2];
+  uint64_t mask[2];
+};
+static_assert(sizeof(FWScanHalfSlot) == 32);
+
 // The numeric port ranges of a slot whose value word 0 carries
 // FW_KEY0_PORT_RANGES (inclusive; 0-65535 for a port the slot compares
 // exactly or not at all).
@@ -49,11 +58,13 @@ struct FWPortRanges {
 struct FWScanIndex {
   uint32_t count;          // slots in use, ruleset order
   uint32_t capacity;
-  FWScanSlot* slots;       // inside this block, 64-byte aligned
+  FWScanSlot* slots;       // inside this block, 64-byte aligned; null when !l2Words
+  FWScanHalfSlot* halfSlots;  // the same storage, when !l2Words; else null
   FWRuleEntry** entries;   // inside this block; entries[i] belongs to slots[i]
   FWPortRanges* ranges;    // inside this block; ranges[i] belongs to slots[i]
   FWClassifier* classifier;  // separate block, or null: scan every slot
-  bool l2Words;            // some slot masks key word 2 or 3; else the scan skips both
+  bool l2Words;            // some slot masks key word 2 or 3; else the scan skips both,
+                           // and the slots are half slots
 };
 
 // Key word 0: ports (numeric) and protocol, presence bits 0-9, the family

@@ -304,6 +304,15 @@ inline FWPacketKey PacketKey(const FWPktSummary* summary, uint32_t presence, uin
   return k;
 }
 
+template <bool kL2>
+struct FWSlotOf {
+  using Type = FWScanSlot;
+};
+template <>
+struct FWSlotOf<false> {
+  using Type = FWScanHalfSlot;
+};
+
 // The keyed lookup: slots tested by their masked words (and the full test
 // when a slot says so), through the classifier when there is one.
 template <bool kL2>
@@ -312,12 +321,14 @@ FWRuleEntry* FWFindKeyed(const FWScanIndex* index, const FWPktSummary* summary,
   const uint32_t count = index->count;
   FWRuleEntry* const* entries = index->entries;
   const FWPacketKey k = PacketKey<kL2>(summary, presence, direction);
-  const FWScanSlot* const slots = index->slots;
+  using Slot = typename FWSlotOf<kL2>::Type;
+  const Slot* const slots = kL2 ? reinterpret_cast<const Slot*>(index->slots)
+                                : reinterpret_cast<const Slot*>(index->halfSlots);
   FWScan s;
   bool started = false;
-  auto miss = [&k](const FWScanSlot& slot) {
+  auto miss = [&k](const Slot& slot) {
     uint64_t m = ((k.k0 ^ slot.value[0]) & slot.mask[0]) | ((k.k1 ^ slot.value[1]) & slot.mask[1]);
-    if (kL2) {
+    if constexpr (kL2) {
       m |= ((k.k2 ^ slot.value[2]) & slot.mask[2]) | ((k.k3 ^ slot.value[3]) & slot.mask[3]);
     }
     return m;
