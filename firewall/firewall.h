@@ -131,6 +131,12 @@ extern void (*g_fwAddBetweenHolds)(SLCGenericFilter* filter);
 // Writes the rules in force; the buffer holds 15 + 281 * numRules bytes.
 void FWPopulateRuleset(FWFilterContext* ctx, FWRuleset* ruleset);
 void FWClearRules(FWFilterContext* ctx);
+// Clears the rules of `ctx` as FWClearRules does, but moves them to
+// `former` (whose other fields it leaves alone) instead of releasing them:
+// called with configLock held exclusively, so that FWClearRules(former)
+// can release them after the hold, when no packet sees them. Allocates
+// nothing.
+void FWTakeRules(FWFilterContext* ctx, FWFilterContext* former);
 
 // --- Lookup (configLock held shared) ----------------------------------------
 

@@ -655,6 +655,21 @@ void FWPopulateRuleset(FWFilterContext* ctx, FWRuleset* ruleset) {
   }
 }
 
+void FWTakeRules(FWFilterContext* ctx, FWFilterContext* former) {
+  List_Init(&former->ruleList);
+  List_Append(&former->ruleList, &ctx->ruleList);
+  former->ruleHash = ctx->ruleHash;
+  former->scanIndex = ctx->scanIndex;
+  former->numRules = ctx->numRules;
+  former->fwFeatures = ctx->fwFeatures;
+  former->generation = 0;
+  ctx->ruleHash = nullptr;
+  ctx->scanIndex = nullptr;
+  ctx->generation++;
+  ctx->numRules = 0;
+  ctx->fwFeatures = 0;
+}
+
 void FWClearRules(FWFilterContext* ctx) {
   ctx->generation++;
   ctx->numRules = 0;

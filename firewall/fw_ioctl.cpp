@@ -224,15 +224,21 @@ void HandleClear(SLCGenericFilter* filter, FWFilterContext* ctx, uint32_t reques
     return;
   }
   uint32_t status = FWIoctlStatusSuccess;
+  FWFilterContext former;
+  bool cleared = false;
   {
     SLCGenericWriteGuard hold(ctx->configLock);
     if (method == FWClearMethodAll) {
       SLCG_LOG_OBJ(SLCG_PROGRESS, filter->name, "Received request to clear all firewall state");
-      FWClearRules(ctx);
+      // The rules are released after the hold: packets wait only for the
+      // swap, not for every entry, socket and pool tag to go.
+      FWTakeRules(ctx, &former);
+      cleared = true;
     } else {
       status = ClearSingleRules(filter, ctx, msg, len, method);
     }
   }
+  if (cleared) FWClearRules(&former);
   SendStatusReply(filter, requestCode, status);
 }
 
