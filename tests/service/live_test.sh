@@ -2,7 +2,9 @@
 # sluice-host on live traffic: namespaces "vm" and "net" joined through
 # sluice-host, rules loaded and changed with sluice-ctl while traffic flows,
 # GRE copies captured in a third namespace, DSCP marks and L2 rewrite seen
-# on the wire. Needs root; exits 77 (skipped) otherwise.
+# on the wire, the device channel, hostile rulesets, ports coming and going.
+# Verdicts and counters of accepted, dropped and punted traffic are checked
+# by slowpath_test.sh. Needs root; exits 77 (skipped) otherwise.
 #
 #   live_test.sh SLUICE_HOST SLUICE_CTL
 set -u
@@ -11,7 +13,7 @@ CTL_BIN=$2
 HERE=$(cd "$(dirname "$0")/../.." && pwd)
 
 . "$HERE/scripts/live-topology.sh"
-topo_require ip ping socat tcpdump timeout python3
+topo_require ip ping tcpdump timeout python3
 P="slt$$"
 DIR=$(mktemp -d /tmp/sluice-live.XXXXXX)
 SOCK="$DIR/ctl.sock"
@@ -34,11 +36,6 @@ in_ns() { local ns=$1; shift; ip netns exec "$P-$ns" "$@"; }
 set_rules() { printf '%s\n' "$@" | ctl ruleset set vm1.eth0 - >/dev/null; }
 send_udp() { local ns=$1; shift; topo_send_udp "$P-$ns" "$@"; }
 heap() { ctl --json stats | topo_json 'd["heapBytes"]'; }
-rule_packets() {  # rule_packets INDEX: packet counter of rule INDEX
-  sleep 0.3  # the last frames may still sit in a receive ring block
-  ctl --json status --agent fw | topo_json \
-    "next(r['packets'] for r in d['agents'][0]['filters'][0]['counters']['rules'] if r['position'] == $1)"
-}
 
 topo_up "$P" || { echo "FAIL could not make namespaces"; exit 1; }
 # Started directly (not through a function) so that $! is the host itself.
@@ -50,36 +47,6 @@ HOST_PID=$!
 for _ in $(seq 50); do ctl hello >/dev/null 2>&1 && break; sleep 0.1; done
 check "host answers" ctl hello
 HEAP0=$(heap)
-
-# --- ping, UDP, TCP pass or drop as the rules say ---------------------------
-check "ping passes with no rules" in_ns vm ping -c 2 -i 0.2 -W 1 -q 10.77.0.2
-set_rules "action=drop ipv4 proto=icmp" "action=drop ipv4 proto=udp dport=6000" \
-  "action=drop ipv4 proto=tcp dport=7001"
-check "ping dropped by an icmp rule" bash -c "! ip netns exec $P-vm ping -c 2 -i 0.2 -W 1 -q 10.77.0.2"
-
-topo_recv_udp "$P-net" 5000 3 "$DIR/u5000"; R1=$LAST_RECV
-topo_recv_udp "$P-net" 6000 3 "$DIR/u6000"; R2=$LAST_RECV
-sleep 0.3
-send_udp vm 10.77.0.2 5000 5; send_udp vm 10.77.0.2 6000 5; wait $R1 $R2
-check "udp to an open port arrives" test "$(wc -l <"$DIR/u5000")" -eq 5
-check "udp to a dropped port does not" test "$(wc -l <"$DIR/u6000")" -eq 0
-
-ip netns exec "$P-net" timeout 5 socat -u TCP-LISTEN:7000,reuseaddr - >"$DIR/t7000" 2>/dev/null &
-T1=$!
-ip netns exec "$P-net" timeout 5 socat -u TCP-LISTEN:7001,reuseaddr - >"$DIR/t7001" 2>/dev/null &
-T2=$!
-sleep 0.3
-echo "hello over tcp" | in_ns vm timeout 3 socat -u - TCP:10.77.0.2:7000,connect-timeout=2 2>/dev/null
-echo "blocked" | in_ns vm timeout 3 socat -u - TCP:10.77.0.2:7001,connect-timeout=2 2>/dev/null
-check "tcp exchange on an open port" grep -q "hello over tcp" "$DIR/t7000"
-check "tcp to a dropped port does not connect" test ! -s "$DIR/t7001"
-kill $T1 $T2 2>/dev/null; wait $T1 $T2 2>/dev/null
-
-# --- counters equal what was sent ---------------------------------------------
-set_rules "action=accept ipv4 proto=udp dport=5100" "action=drop ipv4 proto=udp dport=5101"
-send_udp vm 10.77.0.2 5100 12; send_udp vm 10.77.0.2 5101 7
-check "accept counter equals datagrams sent" test "$(rule_packets 0)" = 12
-check "drop counter equals datagrams sent" test "$(rule_packets 1)" = 7
 
 # --- rules changed while traffic flows lose no accepted packet ----------------
 topo_recv_udp "$P-net" 5200 30 "$DIR/u5200"; sleep 0.3
