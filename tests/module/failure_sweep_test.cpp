@@ -29,6 +29,7 @@
 #include "host/core/faults.h"
 #include "migration/migration.h"
 #include "module/module.h"
+#include "tests/control/control_test_util.h"
 #include "tests/support/migration_support.h"
 #include "tools/lib/frames.h"
 
@@ -37,8 +38,8 @@ namespace {
 using Bytes = std::vector<uint8_t>;
 using host::Faults;
 using Point = Faults::Point;
-const std::string kAgent = testsupport::kDefaultAgent;
-const std::string kProp = kAgent + ".ruleset";
+using controltest::kAgent;
+using controltest::kProp;
 constexpr uint32_t kSlowPath = 7;
 
 // Every action, exact and general rules; version 8 adds the QoS marks and
@@ -82,13 +83,6 @@ std::vector<Bytes> FramesForEveryAction() {
   return out;
 }
 
-Bytes IoctlMsg(uint32_t type, uint32_t word, const Bytes& ruleset = {}) {
-  Bytes m(8 + ruleset.size());
-  std::memcpy(m.data(), &type, 4);
-  std::memcpy(m.data() + 4, &word, 4);
-  std::copy(ruleset.begin(), ruleset.end(), m.begin() + 8);
-  return m;
-}
 
 // What a client can see of the module: agents, each filter's rules read
 // back with their counters, and what the module holds of the host.
@@ -171,7 +165,7 @@ class Life {
              host::Sluice::PropertyWrite(kProp, a_, EveryAction()) == ZEL_OK;
     });
     Undoable("ioctl ruleset", [&] {
-      host::Sluice::SendIoctl(a_, 3, IoctlMsg(FWIoctlMsgRuleset, 0 /* add */, EveryAction(7)));
+      host::Sluice::SendIoctl(a_, 3, controltest::Msg(FWIoctlMsgRuleset, 0 /* add */, EveryAction(7)));
       return LastIoctlStatusOk();
     });
     Undoable("device ruleset", [&] {
@@ -217,9 +211,9 @@ class Life {
     (void)host::Sluice::TakeIoctlReplies(a_);
     Bytes got;
     (void)Device(FWCharDevReqGetRuleset, Bytes(15 + 16 * 281), &got);
-    (void)Device(FWCharDevReqSendIoctl, IoctlMsg(FWIoctlMsgEcho, 0), nullptr);
+    (void)Device(FWCharDevReqSendIoctl, controltest::Msg(FWIoctlMsgEcho, 0), nullptr);
     host::Sluice::SendIoctl(a_, 5, Bytes{FWIoctlMsgEcho, 0, 0, 0, 'h', 'i'});
-    host::Sluice::SendIoctl(a_, 6, IoctlMsg(FWIoctlMsgClear, FWClearMethodStats));
+    host::Sluice::SendIoctl(a_, 6, controltest::Msg(FWIoctlMsgClear, FWClearMethodStats));
     (void)host::Sluice::TakeIoctlReplies(a_);
     StatusTree();
   }
