@@ -31,7 +31,7 @@ class SlowPaths : public ModuleTest {
   }
 };
 
-TEST_F(SlowPaths, FiltersSpreadToTheLeastLoadedTiesToTheOldest) {
+TEST_F(SlowPaths, FiltersSpreadToTheLeastLoadedAndMoveWhenItGoes) {
   Register({1, 2});
 
   std::vector<host::FilterId> ids = MakeFilters(5);
@@ -45,6 +45,18 @@ TEST_F(SlowPaths, FiltersSpreadToTheLeastLoadedTiesToTheOldest) {
   EXPECT_EQ(SlowPath(1)->useCount, 4u);
   EXPECT_EQ(SlowPath(2)->numFilters, 2u);
   for (host::FilterId id : ids) EXPECT_EQ(Filter(id)->refCount, 1u);
+
+  // Unregistering moves the filters to the one left; the last one leaves
+  // them detached.
+  ASSERT_EQ(host::Sluice::UnregisterSlowPath(kDefaultAgent, 1), ZEL_OK);
+  for (host::FilterId id : ids) EXPECT_EQ(host::Sluice::SlowPathOf(id), 2u);
+  EXPECT_EQ(SlowPath(2)->numFilters, 5u);
+  ASSERT_EQ(host::Sluice::UnregisterSlowPath(kDefaultAgent, 2), ZEL_OK);
+  for (host::FilterId id : ids) {
+    EXPECT_EQ(Filter(id)->spAttachState, SLCGenericSpDetached);
+    EXPECT_EQ(Ctx(id)->spAttachState, SLCGenericSpDetached);
+  }
+  EXPECT_TRUE(List_IsEmpty(&Agent()->slowPaths));
 }
 
 TEST_F(SlowPaths, RegistrationAttachesOnlyThroughTheTimer) {
@@ -116,23 +128,6 @@ TEST_F(SlowPaths, RefusedRequestLeavesTheFilterDetached) {
   EXPECT_TRUE(host::Log::Contains("Request to set slow path failed (0xbad0006): Would block", 1));
   // A refused request was never on its way, so nothing was cleared.
   EXPECT_EQ(host::Log::Count("Detaching from slow path #1"), 1u);
-}
-
-TEST_F(SlowPaths, UnregistrationMovesFiltersAndLastOneLeavesThemDetached) {
-  Register({1, 2});
-  std::vector<host::FilterId> ids = MakeFilters(3);
-
-  ASSERT_EQ(host::Sluice::UnregisterSlowPath(kDefaultAgent, 1), ZEL_OK);
-  for (host::FilterId id : ids) EXPECT_EQ(host::Sluice::SlowPathOf(id), 2u);
-  EXPECT_EQ(SlowPath(2)->numFilters, 3u);
-
-  ASSERT_EQ(host::Sluice::UnregisterSlowPath(kDefaultAgent, 2), ZEL_OK);
-  for (host::FilterId id : ids) {
-    EXPECT_EQ(Filter(id)->spAttachState, SLCGenericSpDetached);
-    EXPECT_EQ(Ctx(id)->spAttachState, SLCGenericSpDetached);
-    EXPECT_EQ(host::Sluice::SlowPathOf(id), 0u);
-  }
-  EXPECT_TRUE(List_IsEmpty(&Agent()->slowPaths));
 }
 
 TEST_F(SlowPaths, UnregistrationWhileAttachingIsBusyUntilTheReply) {
