@@ -1,5 +1,6 @@
-// Filter records: configuration reads, creation failing at each step,
-// destruction while requests are in flight, and garbage on every callback.
+// Filter records: configuration reads, creation failing at each step, and
+// garbage on every callback. Destruction while requests are in flight:
+// slowpath_test.
 
 #include <cstring>
 
@@ -89,22 +90,6 @@ TEST_F(Filters, CreationFailuresFreeEverything) {
   EXPECT_TRUE(host::Log::Contains("Failed to allocate memory for agent context", 2));
 
   EXPECT_TRUE(List_IsEmpty(&Agent()->filters));
-}
-
-TEST_F(Filters, DestroyIsBusyWhileAReplyIsOutstanding) {
-  host::FilterId id = CreateFilter();
-  host::Sluice::SetPolicy(host::RequestKind::SetSlowPath, testsupport::Replies(host::ReplyMode::Deferred));
-  ASSERT_EQ(host::Sluice::RegisterSlowPath(kDefaultAgent, 1), ZEL_OK);
-  host::Timers::RunDue();
-  ASSERT_EQ(Filter(id)->spAttachState, SLCGenericSpAttaching);
-
-  EXPECT_EQ(host::Sluice::DestroyFilter(id), ZEL_BUSY);
-  EXPECT_FALSE(List_IsEmpty(&Agent()->filters));
-
-  EXPECT_EQ(host::Sluice::ReleaseReplies(host::RequestKind::SetSlowPath), 1u);
-  EXPECT_EQ(Filter(id)->spAttachState, SLCGenericSpAttached);
-  EXPECT_EQ(host::Sluice::DestroyFilter(id), ZEL_OK);
-  EXPECT_TRUE(host::Log::Contains("Detaching from slow path #1", 1));
 }
 
 TEST_F(Filters, ConfigurationChangeRereadsOnlyTheRecord) {
