@@ -1,6 +1,9 @@
 // The slow path link: choice of the least-loaded slow path, the attach
 // timer, retries, detachment and unregistration.
 
+#include <chrono>
+#include <thread>
+
 #include "tests/support/module_fixture.h"
 
 namespace {
@@ -144,6 +147,22 @@ TEST_F(SlowPaths, UnregistrationWhileAttachingIsBusyUntilTheReply) {
   EXPECT_EQ(Filter(id)->spAttachState, SLCGenericSpAttached);
   EXPECT_EQ(host::Sluice::UnregisterSlowPath(kDefaultAgent, 5), ZEL_OK);
   EXPECT_EQ(Filter(id)->spAttachState, SLCGenericSpDetached);
+}
+
+// Unloading while a filter's attach reply is outstanding: the filter
+// answers busy until the reply comes, and the framework keeps asking,
+// holding nothing the reply (sent from another thread) needs.
+TEST_F(SlowPaths, UnloadWaitsOutAnAttachReplyReleasedMeanwhile) {
+  host::Sluice::SetPolicy(host::RequestKind::SetSlowPath, Replies(host::ReplyMode::Deferred));
+  Register({1});
+  ASSERT_EQ(Filter(CreateFilter())->spAttachState, SLCGenericSpAttaching);
+  std::thread releaser([] {
+    std::this_thread::sleep_for(std::chrono::milliseconds(30));
+    host::Sluice::ReleaseReplies(host::RequestKind::SetSlowPath);
+  });
+  Unload();
+  releaser.join();
+  EXPECT_FALSE(host::Sluice::AgentRegistered(kDefaultAgent));
 }
 
 TEST_F(SlowPaths, TransientClearKeepsTheFilterAttached) {
