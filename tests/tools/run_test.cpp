@@ -60,7 +60,9 @@ class Run : public ::testing::Test {
   runner::Result result_;
 };
 
-TEST_F(Run, TraceNamesTheRuleTheCountersSayWasHit) {
+// One run, three views of it: the trace against the counters, the fates,
+// and the GRE datagrams.
+TEST_F(Run, TraceCountersFatesAndGreDatagramsAgree) {
   std::map<uint32_t, std::pair<uint64_t, uint64_t>> hits;  // position -> packets, bytes
   uint64_t noMatch = 0;
   for (const render::PacketReport& p : result_.packets) {
@@ -91,9 +93,7 @@ TEST_F(Run, TraceNamesTheRuleTheCountersSayWasHit) {
   // The exact rule sits first in the module, third in the ruleset.
   EXPECT_EQ(listed[2].position, 0u);
   EXPECT_EQ(Packet(2).trace.decision, +FWTraceExactRule);
-}
 
-TEST_F(Run, FatesFollowTheActions) {
   using render::Fate;
   const std::vector<std::vector<Fate>> want = {
       {Fate::Dropped},         {Fate::ToVm},       {Fate::SlowPath},
@@ -111,9 +111,8 @@ TEST_F(Run, FatesFollowTheActions) {
   ASSERT_FALSE(Packet(13).changes.empty());
   EXPECT_EQ(Packet(13).changes[0].offset, 15u);
   EXPECT_EQ(Packet(13).changes[0].after, (46 << 2) | 0x01);
-}
 
-TEST_F(Run, GreDatagramsAreWhatTheReceiverSees) {
+  // GRE datagrams are what the receiver sees.
   ASSERT_EQ(result_.outputs.gre.size(), 2u);
   for (size_t i = 0; i < 2; i++) {
     SCOPED_TRACE(i);
