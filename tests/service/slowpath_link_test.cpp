@@ -4,11 +4,9 @@
 // with an error, drops a link it can no longer trust, unregisters its slow
 // path, and keeps serving with its heap as it was. Needs no root: the host
 // runs with no ports.
-#include <sys/socket.h>
 #include <unistd.h>
 
 #include <chrono>
-#include <cstring>
 #include <string>
 #include <thread>
 
