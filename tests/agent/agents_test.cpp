@@ -21,16 +21,22 @@ std::vector<std::string> AgentNames() {
 
 using AgentProperty = ModuleTest;
 
-TEST_F(AgentProperty, CreatesEachNameInOrderAndSkipsRepeats) {
-  EXPECT_EQ(CreateAgents("alpha beta"), ZEL_OK);
+// Names in order, each with the configuration after its first colon; a
+// repeat compares only the name and changes nothing.
+TEST_F(AgentProperty, CreatesEachNameInOrderWithItsConfigurationAndSkipsRepeats) {
+  EXPECT_EQ(CreateAgents("alpha dropper:default-action=ACTION_DROP:x"), ZEL_OK);
   EXPECT_EQ(AgentNames(),
-            (std::vector<std::string>{"sluice-generic-quelmar", "alpha", "beta"}));
+            (std::vector<std::string>{"sluice-generic-quelmar", "alpha", "dropper"}));
   EXPECT_TRUE(host::Sluice::AgentRegistered("alpha"));
-  EXPECT_TRUE(host::Sluice::AgentRegistered("beta"));
+  SLCGenericFastPath* fp = Agent("dropper");
+  ASSERT_NE(fp, nullptr);
+  EXPECT_STREQ(fp->configPtr, "default-action=ACTION_DROP:x");
+  EXPECT_EQ(Ctx(CreateFilter("dropper"))->defaultAction, SLCGenericActionDrop);
 
-  EXPECT_EQ(CreateAgents("alpha beta"), ZEL_OK);
+  EXPECT_EQ(CreateAgents("alpha dropper:default-action=ACTION_PUNT"), ZEL_OK);
   EXPECT_EQ(host::Log::Count("Agent alpha already exists. Not recreating", 1), 1u);
-  EXPECT_EQ(host::Log::Count("Agent beta already exists. Not recreating", 1), 1u);
+  EXPECT_EQ(host::Log::Count("Agent dropper already exists. Not recreating", 1), 1u);
+  EXPECT_STREQ(fp->configPtr, "default-action=ACTION_DROP:x");
   EXPECT_EQ(AgentNames().size(), 3u);
 }
 
@@ -57,20 +63,13 @@ TEST_F(AgentProperty, EmptyPiecesCreateNothing) {
                                                     "y", "tab\tbed"}));
 }
 
-TEST_F(AgentProperty, ConfigurationFollowsTheFirstColon) {
-  EXPECT_EQ(CreateAgents("dropper:default-action=ACTION_DROP:x"), ZEL_OK);
-  SLCGenericFastPath* fp = Agent("dropper");
-  ASSERT_NE(fp, nullptr);
-  EXPECT_STREQ(fp->configPtr, "default-action=ACTION_DROP:x");
-  EXPECT_EQ(Ctx(CreateFilter("dropper"))->defaultAction, SLCGenericActionDrop);
-
-  // A repeat compares only the name and changes nothing.
-  EXPECT_EQ(CreateAgents("dropper:default-action=ACTION_PUNT"), ZEL_OK);
-  EXPECT_STREQ(fp->configPtr, "default-action=ACTION_DROP:x");
-  EXPECT_EQ(host::Log::Count("Agent dropper already exists. Not recreating"), 1u);
-}
-
+// A refused name buffer creates nothing; a failed agent ends the list,
+// keeping the agents made before it.
 TEST_F(AgentProperty, StopsAtFirstFailureKeepingEarlierAgents) {
+  host::Faults::Fail("zel_HeapAllocWithRA", ZEL_NO_MEMORY);
+  EXPECT_EQ(CreateAgents("nobuf"), ZEL_FAILURE);
+  EXPECT_TRUE(host::Log::Contains("Failed to allocate memory for agent names", 2));
+  EXPECT_EQ(AgentNames().size(), 1u);
   host::Faults::Fail("zel_SluiceRegisterFastPath", ZEL_FAILURE, 2);
   EXPECT_EQ(CreateAgents("one two three"), ZEL_FAILURE);
   EXPECT_EQ(AgentNames(), (std::vector<std::string>{"sluice-generic-quelmar", "one"}));
@@ -82,13 +81,6 @@ TEST_F(AgentProperty, NamesAreCutToFit) {
   EXPECT_EQ(CreateAgents(longName + ":" + std::string(200, 'c')), ZEL_OK);
   EXPECT_EQ(AgentNames().back(), std::string(99, 'n'));
   EXPECT_EQ(std::string(Agent(std::string(99, 'n'))->configPtr), std::string(127, 'c'));
-}
-
-TEST_F(AgentProperty, BufferRefused) {
-  host::Faults::Fail("zel_HeapAllocWithRA", ZEL_NO_MEMORY);
-  EXPECT_EQ(CreateAgents("nobuf"), ZEL_FAILURE);
-  EXPECT_TRUE(host::Log::Contains("Failed to allocate memory for agent names", 2));
-  EXPECT_EQ(AgentNames().size(), 1u);
 }
 
 // Each step failing in turn: the agent is undone with the step's status and

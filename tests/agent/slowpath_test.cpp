@@ -1,6 +1,9 @@
 // The slow path link: choice of the least-loaded slow path, the attach
 // timer, retries, detachment and unregistration.
 
+#include <chrono>
+#include <thread>
+
 #include "tests/support/module_fixture.h"
 
 namespace {
@@ -31,7 +34,7 @@ class SlowPaths : public ModuleTest {
   }
 };
 
-TEST_F(SlowPaths, FiltersSpreadToTheLeastLoadedTiesToTheOldest) {
+TEST_F(SlowPaths, FiltersSpreadToTheLeastLoadedAndMoveWhenItGoes) {
   Register({1, 2});
 
   std::vector<host::FilterId> ids = MakeFilters(5);
@@ -45,6 +48,18 @@ TEST_F(SlowPaths, FiltersSpreadToTheLeastLoadedTiesToTheOldest) {
   EXPECT_EQ(SlowPath(1)->useCount, 4u);
   EXPECT_EQ(SlowPath(2)->numFilters, 2u);
   for (host::FilterId id : ids) EXPECT_EQ(Filter(id)->refCount, 1u);
+
+  // Unregistering moves the filters to the one left; the last one leaves
+  // them detached.
+  ASSERT_EQ(host::Sluice::UnregisterSlowPath(kDefaultAgent, 1), ZEL_OK);
+  for (host::FilterId id : ids) EXPECT_EQ(host::Sluice::SlowPathOf(id), 2u);
+  EXPECT_EQ(SlowPath(2)->numFilters, 5u);
+  ASSERT_EQ(host::Sluice::UnregisterSlowPath(kDefaultAgent, 2), ZEL_OK);
+  for (host::FilterId id : ids) {
+    EXPECT_EQ(Filter(id)->spAttachState, SLCGenericSpDetached);
+    EXPECT_EQ(Ctx(id)->spAttachState, SLCGenericSpDetached);
+  }
+  EXPECT_TRUE(List_IsEmpty(&Agent()->slowPaths));
 }
 
 TEST_F(SlowPaths, RegistrationAttachesOnlyThroughTheTimer) {
@@ -118,23 +133,6 @@ TEST_F(SlowPaths, RefusedRequestLeavesTheFilterDetached) {
   EXPECT_EQ(host::Log::Count("Detaching from slow path #1"), 1u);
 }
 
-TEST_F(SlowPaths, UnregistrationMovesFiltersAndLastOneLeavesThemDetached) {
-  Register({1, 2});
-  std::vector<host::FilterId> ids = MakeFilters(3);
-
-  ASSERT_EQ(host::Sluice::UnregisterSlowPath(kDefaultAgent, 1), ZEL_OK);
-  for (host::FilterId id : ids) EXPECT_EQ(host::Sluice::SlowPathOf(id), 2u);
-  EXPECT_EQ(SlowPath(2)->numFilters, 3u);
-
-  ASSERT_EQ(host::Sluice::UnregisterSlowPath(kDefaultAgent, 2), ZEL_OK);
-  for (host::FilterId id : ids) {
-    EXPECT_EQ(Filter(id)->spAttachState, SLCGenericSpDetached);
-    EXPECT_EQ(Ctx(id)->spAttachState, SLCGenericSpDetached);
-    EXPECT_EQ(host::Sluice::SlowPathOf(id), 0u);
-  }
-  EXPECT_TRUE(List_IsEmpty(&Agent()->slowPaths));
-}
-
 TEST_F(SlowPaths, UnregistrationWhileAttachingIsBusyUntilTheReply) {
   host::Sluice::SetPolicy(host::RequestKind::SetSlowPath, Replies(host::ReplyMode::Deferred));
   Register({5});
@@ -149,6 +147,22 @@ TEST_F(SlowPaths, UnregistrationWhileAttachingIsBusyUntilTheReply) {
   EXPECT_EQ(Filter(id)->spAttachState, SLCGenericSpAttached);
   EXPECT_EQ(host::Sluice::UnregisterSlowPath(kDefaultAgent, 5), ZEL_OK);
   EXPECT_EQ(Filter(id)->spAttachState, SLCGenericSpDetached);
+}
+
+// Unloading while a filter's attach reply is outstanding: the filter
+// answers busy until the reply comes, and the framework keeps asking,
+// holding nothing the reply (sent from another thread) needs.
+TEST_F(SlowPaths, UnloadWaitsOutAnAttachReplyReleasedMeanwhile) {
+  host::Sluice::SetPolicy(host::RequestKind::SetSlowPath, Replies(host::ReplyMode::Deferred));
+  Register({1});
+  ASSERT_EQ(Filter(CreateFilter())->spAttachState, SLCGenericSpAttaching);
+  std::thread releaser([] {
+    std::this_thread::sleep_for(std::chrono::milliseconds(30));
+    host::Sluice::ReleaseReplies(host::RequestKind::SetSlowPath);
+  });
+  Unload();
+  releaser.join();
+  EXPECT_FALSE(host::Sluice::AgentRegistered(kDefaultAgent));
 }
 
 TEST_F(SlowPaths, TransientClearKeepsTheFilterAttached) {

@@ -1,5 +1,7 @@
 // The status tree: filter instance names, ruleset summaries, rule positions
-// and rule summaries, agent creation, and failures that leave no lock held.
+// and rule summaries, and failures that leave no lock held. Agents made
+// through the create-agent node: agents_test, concurrency_test and the
+// control socket test.
 #include <map>
 #include <sstream>
 
@@ -64,16 +66,6 @@ TEST_F(StatusTreeTest, InstanceNamesAndRuleSetSummaries) {
   want["version"] = "7", want["numRules"] = "2", want["ioctl"] = "1";
   want["fragOverride"] = "SLCGenericActionPunt (punt packets to slowpath)";
   EXPECT_EQ(Render(At("fw-1", {"ruleSetSummary"})), want);
-}
-
-TEST_F(StatusTreeTest, CreateAgentMakesAnAgentWithItsConfiguration) {
-  auto create = [](const Values& input) { return StatusTree::Set({"createAgent"}, input); };
-  EXPECT_EQ(create({std::string("made:default-action=ACTION_PUNT")}), ZEL_OK);
-  EXPECT_EQ(Ctx(CreateFilter("made", "vnic0"))->defaultAction, uint32_t(SLCGenericActionPunt));
-  EXPECT_EQ(create({int64_t(5)}), ZEL_BAD_PARAM_TYPE);
-  host::Faults::Fail("zel_SluiceRegisterFastPath", ZEL_BUSY);
-  EXPECT_EQ(create({std::string("refused")}), ZEL_BUSY);
-  EXPECT_EQ(List({"agents"}), Strings({kAgent, "made"}));  // oldest first
 }
 
 // Every failure returns its status with no lock held. `fault`: a host call

@@ -1,12 +1,17 @@
-// The compiled classifier of the general rules against the reference model
-// (the ordered first-match scan written from the rule semantics), and its
-// build under allocation failure.
+// The two-stage lookup (exact-rule table, then the compiled classifier of
+// the general rules) against the reference model (the ordered first-match
+// scan written from the rule semantics), and the classifier's build under
+// allocation failure.
 //
 // The build limits are lowered so that small rulesets get deep trees, long
 // residual lists and the memory bound; rules and packets are drawn from
 // pools of prefixes, ranges and values that overlap a lot, in both
 // families, with negations, masked MACs, 802.1Q tags, pool tags, version-7
-// records, add sequences and single-rule removals.
+// records, add sequences and single-rule removals. Packet directions other
+// than 1 and 2, which the scan index does not encode, fall back to the full
+// test of every rule. Exact rules draw their keys from small pools, so that
+// repeats merge and mirrors meet their originals, and packets often carry
+// an installed exact rule's very key.
 #include <fmt/format.h>
 #include <gtest/gtest.h>
 
@@ -41,6 +46,9 @@ class Gen {
 
   // How often a rule compares each L2 field (MACs, ethertype, 802.1Q tag).
   int l2Percent = 10;
+
+  static constexpr uint8_t kMacs[3][6] = {
+      {2, 0, 0, 0, 0, 1}, {2, 0, 0, 0, 0, 2}, {2, 0x11, 0x22, 0x33, 0x44, 0x55}};
 
   uint32_t U(uint32_t n) { return rng_() % n; }
   bool P(int percent) { return static_cast<int>(U(100)) < percent; }
@@ -81,15 +89,41 @@ class Gen {
     return P(70) ? kPorts[U(8)] : static_cast<uint16_t>(U(65536));
   }
 
+  // Every field compared; four addresses per family and three ports.
+  FWRule Exact(uint8_t version, uint64_t id) {
+    FWRule r;
+    std::memset(&r, 0, sizeof(r));
+    r.action = 1 + U(3);
+    r.direction = static_cast<uint8_t>(U(4));
+    r.bidirectional = static_cast<uint8_t>(U(3));
+    r.pktCount = id;
+    const bool v4 = P(50);
+    r.ruleFlags = v4 ? FW_FLAG_IPV4 : 0;
+    if (P(40)) r.ruleFlags |= FW_WC_RPTAG; else r.rpTag = static_cast<uint16_t>(U(3));
+    std::memcpy(r.dMac, kMacs[U(3)], 6);
+    std::memcpy(r.sMac, kMacs[U(3)], 6);
+    FWPutNet16(r.ethType, v4 ? 0x0800 : 0x86dd);
+    if (P(30)) r.vlan1QTag[0] = 0x81, r.vlan1QTag[3] = static_cast<uint8_t>(U(2));
+    for (uint8_t* a : {r.ipSa, r.ipDa}) {
+      Addr(v4, a);
+      a[v4 ? 3 : 15] &= 3;
+      if (v4) a[2] = 0;
+    }
+    r.ipProto = P(50) ? 6 : 17;
+    static const uint16_t kPorts[] = {53, 80, 443};
+    FWPutNet16(r.sPort, kPorts[U(3)]);
+    FWPutNet16(r.dPort, kPorts[U(3)]);
+    if (version == 7) std::memset(reinterpret_cast<uint8_t*>(&r) + 259, 0, 281 - 259);
+    return r;
+  }
+
   FWRule Rule(uint8_t version, uint64_t id) {
-    static const uint8_t kMacs[3][6] = {
-        {2, 0, 0, 0, 0, 1}, {2, 0, 0, 0, 0, 2}, {2, 0x11, 0x22, 0x33, 0x44, 0x55}};
     static const uint8_t kMasks[3][6] = {
         {0xff, 0xff, 0xff, 0, 0, 0}, {0xff, 0, 0, 0, 0, 0xff}, {}};
     FWRule r;
     std::memset(&r, 0, sizeof(r));
     r.action = 1 + U(3);
-    r.direction = P(3) ? 0 : static_cast<uint8_t>(1 + U(3));
+    r.direction = static_cast<uint8_t>(P(3) ? U(8) : 1 + U(3));
     r.bidirectional = static_cast<uint8_t>(U(3));
     r.pktCount = id;  // tells rules apart
     const bool v4 = P(60);
@@ -142,9 +176,28 @@ class Gen {
     return r;
   }
 
-  // Half the packets inside a random rule's ranges, half from the pools.
+  // Some packets with an installed exact rule's key, some too short to
+  // parse; of the rest, half inside a random general rule's ranges, half
+  // from the pools.
   ModelPacket Packet(const FwModel& model) {
     ModelPacket p;
+    if (!model.Exact().empty() && P(30)) {
+      const FWRule& r = model.Exact()[U(static_cast<uint32_t>(model.Exact().size()))];
+      p.presence |= FW_PKT_L2 | FW_PKT_L3 | FW_PKT_PORTS |
+                    (r.ruleFlags & FW_FLAG_IPV4 ? FW_PKT_IPV4 : FW_PKT_IPV6) |
+                    (r.ipProto == 17 ? FW_PKT_UDP : FW_PKT_TCP);
+      std::memcpy(p.dMac, r.dMac, 6);
+      std::memcpy(p.sMac, r.sMac, 6);
+      std::memcpy(p.ethType, r.ethType, 2);
+      std::memcpy(p.vlan1QTag, r.vlan1QTag, 4);
+      std::memcpy(p.ipSa, r.ipSa, 16);
+      std::memcpy(p.ipDa, r.ipDa, 16);
+      p.ipProto = r.ipProto;
+      std::memcpy(p.sPort, r.sPort, 2);
+      std::memcpy(p.dPort, r.dPort, 2);
+      return p;
+    }
+    if (P(2)) return p;  // too short to parse: only the pool-tag bit
     p.presence |= FW_PKT_L2;
     p.dMac[0] = 2;
     p.dMac[5] = static_cast<uint8_t>(1 + U(2));
@@ -220,12 +273,13 @@ class ClassifierTest : public FirewallTest {
   void ExpectSameAsModel(Gen& gen, const FwModel& model, uint32_t iter, uint32_t packets) {
     for (uint32_t k = 0; k < packets; k++) {
       const ModelPacket p = gen.Packet(model);
-      const uint32_t dir = 1 + gen.U(2);
+      const uint32_t dir = gen.P(5) ? gen.U(8) : 1 + gen.U(2);
       const uint16_t tag = static_cast<uint16_t>(gen.U(3));
       const FWRuleEntry* got = Lookup(p, dir, tag);
       const auto want = model.Match(p.Summary(), dir, tag);
       checked_++;
       hits_ += want.has_value();
+      exactHits_ += want && rules::IsExactRule(*want);
       if (!Same(got, want)) {
         ADD_FAILURE() << "iteration " << iter << " packet " << k << " dir " << dir << " tag "
                       << tag << " presence 0x" << std::hex << p.presence << Versus(got, want);
@@ -258,7 +312,7 @@ class ClassifierTest : public FirewallTest {
     }
   }
 
-  uint64_t checked_ = 0, hits_ = 0;
+  uint64_t checked_ = 0, hits_ = 0, exactHits_ = 0;
 };
 
 TEST_F(ClassifierTest, SameRuleAsTheOrderedScanForEveryPacket) {
@@ -273,13 +327,18 @@ TEST_F(ClassifierTest, SameRuleAsTheOrderedScanForEveryPacket) {
     // Now and then no rule compares an L2 field, so the lookup leaves the
     // L2 key words out.
     gen.l2Percent = gen.P(30) ? 0 : 10;
+    // Now and then one rule in four is exact (never the first, so that
+    // the classifier always has rules).
+    const bool withExact = gen.P(30);
     FwModel model;
     const uint32_t applications = 1 + gen.U(3);
     for (uint32_t a = 0; a < applications; a++) {
       const uint8_t version = gen.P(25) ? 7 : 8;
       rules::RulesetBuilder b(version);
       const uint32_t n = 1 + gen.U(a == 0 ? 300 : 60);
-      for (uint32_t i = 0; i < n; i++) b.Add(gen.Rule(version, id++));
+      for (uint32_t i = 0; i < n; i++) {
+        b.Add(withExact && i % 4 == 3 ? gen.Exact(version, id++) : gen.Rule(version, id++));
+      }
       const auto rs = b.Bytes();
       if (a == 0 && gen.P(50)) {
         // The control channels' road: everything built before the
@@ -293,6 +352,7 @@ TEST_F(ClassifierTest, SameRuleAsTheOrderedScanForEveryPacket) {
       }
       model.Apply(rs, a == 0);
     }
+    ASSERT_EQ(ctx_->numRules, model.NumRules()) << "iteration " << iter;
     ASSERT_NE(ctx_->scanIndex, nullptr);
     const FWClassifier* cls = ctx_->scanIndex->classifier;
     ASSERT_NE(cls, nullptr);
@@ -302,6 +362,7 @@ TEST_F(ClassifierTest, SameRuleAsTheOrderedScanForEveryPacket) {
     noL2 += !ctx_->scanIndex->l2Words;
     ExpectSameAsModel(gen, model, iter, 300);
     if (HasFailure()) return;
+    if (withExact) continue;
 
     // Remove a few rules one by one. The reference is the model of the
     // rules left in the list, in order (which of several equal rules a
@@ -327,7 +388,9 @@ TEST_F(ClassifierTest, SameRuleAsTheOrderedScanForEveryPacket) {
   EXPECT_GT(oneLeaf, 5u);  // a lookup with a single leaf to walk (the sweep below: always)
   EXPECT_GT(noL2, 50u);
   EXPECT_GT(hits_, checked_ / 3);
-  RecordProperty("hits", std::to_string(hits_) + "/" + std::to_string(checked_));
+  EXPECT_GT(exactHits_, checked_ / 100);
+  RecordProperty("hits", std::to_string(hits_) + "/" + std::to_string(checked_) + " exact " +
+                             std::to_string(exactHits_));
 }
 
 // Every value of one dimension, against rulesets of overlapping port

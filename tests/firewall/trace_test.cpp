@@ -33,6 +33,12 @@ class Trace : public PacketPathTest {
 };
 
 TEST_F(Trace, EachDecisionIsReportedWithItsRuleAndPosition) {
+  // Without a ruleset the default action decides.
+  const FWTrace none = TraceOf(Tcp4(), 1);
+  EXPECT_EQ(none.decision, +FWTraceNoRuleset);
+  EXPECT_EQ(none.action, ctx_->defaultAction);
+  EXPECT_EQ(FWTracePacket(filter_, nullptr, 1, nullptr), ZEL_BAD_PARAM);
+
   // Two exact rules, then three general ones; the general rules follow the
   // exact ones in serialised order.
   ApplyText("ruleset features=3 frag=drop\n" + ExactTcp4("accept") + "\n" +
@@ -96,13 +102,6 @@ TEST_F(Trace, EachDecisionIsReportedWithItsRuleAndPosition) {
       }
     }
   }
-}
-
-TEST_F(Trace, WithoutARulesetTheDefaultActionDecides) {
-  const FWTrace t = TraceOf(Tcp4(), 1);
-  EXPECT_EQ(t.decision, +FWTraceNoRuleset);
-  EXPECT_EQ(t.action, ctx_->defaultAction);
-  EXPECT_EQ(FWTracePacket(filter_, nullptr, 1, nullptr), ZEL_BAD_PARAM);
 }
 
 // Traces run beside walks that raise counters and beside rulesets being

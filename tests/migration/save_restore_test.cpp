@@ -229,18 +229,6 @@ TEST_F(SaveRestoreTest, RestoreHeaderChecksRejectInOrderAndChangeNothing) {
   }
 }
 
-TEST_F(SaveRestoreTest, SlowPathPartWithoutSlowPathFollowsTheFailurePolicy) {
-  const Bytes state = SavedState(SampleRules(), Pattern(10));
-  EXPECT_EQ(Restore(state, f_), ZEL_FAILURE);  // policy 0: nothing restored
-  ExpectUntouched(f_);
-  SLCGenericFilter* lenient = Filter(NewFilter("vnic1", 1));  // policy 1: the part is dropped
-  EXPECT_EQ(Restore(state, lenient), ZEL_OK);
-  EXPECT_EQ(host::Log::Count("Have saved slow path state, but no slow path", 1), 2u);
-  EXPECT_EQ(host::Log::Count("Finished restoring state", 1), 1u);
-  EXPECT_EQ(Rules(lenient), SampleRules());
-  EXPECT_TRUE(host::Sluice::Requests(RestoreState).empty());
-}
-
 // Hostile saved state: every header field corrupted in turn (alone or with a
 // second one, sums past 2^64 included), then rule counts running past the
 // fast path part, for both versions. Restored, or rejected with a message and

@@ -29,66 +29,17 @@
 #include "host/core/faults.h"
 #include "migration/migration.h"
 #include "module/module.h"
+#include "tests/control/control_test_util.h"
 #include "tests/support/migration_support.h"
-#include "tools/lib/frames.h"
 
 namespace {
 
 using Bytes = std::vector<uint8_t>;
 using host::Faults;
 using Point = Faults::Point;
-const std::string kAgent = testsupport::kDefaultAgent;
-const std::string kProp = kAgent + ".ruleset";
+using controltest::kAgent;
+using controltest::kProp;
 constexpr uint32_t kSlowPath = 7;
-
-// Every action, exact and general rules; version 8 adds the QoS marks and
-// a resource-pool tag match.
-Bytes EveryAction(uint8_t version = 8) {
-  rules::RulesetBuilder b(version);
-  b.Add("action=accept dir=both ipv4 proto=tcp sa=10.0.0.1 da=10.0.0.2 sport=1000 dport=80 bidir");
-  b.Add("action=drop dir=to ipv4 proto=udp sa=10.0.0.2 da=10.0.0.3 sport=53 dport=5353");
-  b.Add("action=copy ipv4 proto=udp dport=53");
-  b.Add("action=punt ipv6 proto=tcp dport=22");
-  b.Add("action=l2rewrite rewrite=02:00:00:00:00:99 ipv4 proto=tcp dport=8080");
-  b.Add("action=gre gre=198.51.100.7 snaplen=64 ipv4 proto=tcp dport=443");
-  b.Add("action=pooltag pool=gold ipv4 proto=udp dport=4789");
-  b.Add("action=log ipv4 proto=tcp dport=25");
-  if (version == 8) {
-    b.Add("action=accept rptag=7 ipv4 proto=tcp dport=9");
-    // An exact rule comparing the tag reads it on the exact lookup.
-    b.Add("action=accept rptag=7 exact dmac=02:00:00:00:00:02 smac=02:00:00:00:00:01 vlan=none "
-          "ipv4 proto=tcp sa=10.0.0.1 da=10.0.0.2 sport=1000 dport=7");
-    b.Add("action=dot1p dot1p=2 ipv4 proto=udp dport=7777");
-    b.Add("action=dscp+dot1p dscp=46 dot1p=5 ipv4 sa=10.0.0.0-10.0.0.255");
-  }
-  b.Add("action=drop ethtype=0x0806");
-  return b.Bytes();
-}
-
-std::vector<Bytes> FramesForEveryAction() {
-  using frames::FrameBuilder, frames::Ip4, frames::Ip6, frames::Mac;
-  const auto a = Mac("02:00:00:00:00:01"), b = Mac("02:00:00:00:00:02");
-  std::vector<Bytes> out;
-  for (uint16_t dport : {80, 443, 8080, 25, 9, 7}) {
-    out.push_back(FrameBuilder().Eth(b, a).Ipv4(Ip4("10.0.0.1"), Ip4("10.0.0.2")).Tcp(1000, dport)
-                      .Payload(20).Build());
-  }
-  for (uint16_t dport : {53, 5353, 4789, 7777}) {
-    out.push_back(FrameBuilder().Eth(b, a).Ipv4(Ip4("10.0.0.2"), Ip4("10.0.0.3")).Udp(53, dport)
-                      .Build());
-  }
-  out.push_back(FrameBuilder().Eth(b, a).Ipv6(Ip6("2001:db8::1"), Ip6("2001:db8::2")).Tcp(5, 22)
-                    .Build());
-  return out;
-}
-
-Bytes IoctlMsg(uint32_t type, uint32_t word, const Bytes& ruleset = {}) {
-  Bytes m(8 + ruleset.size());
-  std::memcpy(m.data(), &type, 4);
-  std::memcpy(m.data() + 4, &word, 4);
-  std::copy(ruleset.begin(), ruleset.end(), m.begin() + 8);
-  return m;
-}
 
 // What a client can see of the module: agents, each filter's rules read
 // back with their counters, and what the module holds of the host.
@@ -168,14 +119,15 @@ class Life {
   void Rulesets() {
     Undoable("property write", [&] {
       return !host::Sluice::PropertyRegistered(kProp) ||
-             host::Sluice::PropertyWrite(kProp, a_, EveryAction()) == ZEL_OK;
+             host::Sluice::PropertyWrite(kProp, a_, migsupport::EveryAction()) == ZEL_OK;
     });
     Undoable("ioctl ruleset", [&] {
-      host::Sluice::SendIoctl(a_, 3, IoctlMsg(FWIoctlMsgRuleset, 0 /* add */, EveryAction(7)));
+      host::Sluice::SendIoctl(a_, 3, controltest::Msg(FWIoctlMsgRuleset, 0 /* add */,
+                                                      migsupport::EveryAction(7)));
       return LastIoctlStatusOk();
     });
     Undoable("device ruleset", [&] {
-      return Device(FWCharDevReqSetRuleset, EveryAction(), nullptr);
+      return Device(FWCharDevReqSetRuleset, migsupport::EveryAction(), nullptr);
     });
   }
 
@@ -185,7 +137,7 @@ class Life {
   void Traffic() {
     for (uint32_t dir = 1; dir <= 2; dir++) {
       host::PacketList list;
-      for (const Bytes& f : FramesForEveryAction()) {
+      for (const Bytes& f : migsupport::FramesForEveryAction()) {
         host::PacketSpec shared;
         shared.frame = f;
         shared.mappedLen = 14;
@@ -202,7 +154,7 @@ class Life {
       (void)host::Sluice::Deliver(a_, list, dir);
     }
     host::PacketList fromSlowPath;
-    fromSlowPath.Append(host::Packets::Make(FramesForEveryAction()[0]));
+    fromSlowPath.Append(host::Packets::Make(migsupport::FramesForEveryAction()[0]));
     (void)host::Sluice::DeliverFromSlowPath(a_, fromSlowPath, 1);
     Drain(a_);
   }
@@ -217,9 +169,9 @@ class Life {
     (void)host::Sluice::TakeIoctlReplies(a_);
     Bytes got;
     (void)Device(FWCharDevReqGetRuleset, Bytes(15 + 16 * 281), &got);
-    (void)Device(FWCharDevReqSendIoctl, IoctlMsg(FWIoctlMsgEcho, 0), nullptr);
+    (void)Device(FWCharDevReqSendIoctl, controltest::Msg(FWIoctlMsgEcho, 0), nullptr);
     host::Sluice::SendIoctl(a_, 5, Bytes{FWIoctlMsgEcho, 0, 0, 0, 'h', 'i'});
-    host::Sluice::SendIoctl(a_, 6, IoctlMsg(FWIoctlMsgClear, FWClearMethodStats));
+    host::Sluice::SendIoctl(a_, 6, controltest::Msg(FWIoctlMsgClear, FWClearMethodStats));
     (void)host::Sluice::TakeIoctlReplies(a_);
     StatusTree();
   }

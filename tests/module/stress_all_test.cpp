@@ -22,7 +22,6 @@
 #include "host/control/control_host.h"
 #include "tests/control/control_test_util.h"
 #include "tests/support/migration_support.h"
-#include "tools/lib/frames.h"
 
 namespace {
 
@@ -40,19 +39,6 @@ ZelStatus UntilNotBusy(Op op) {
   ZelStatus status;
   while ((status = op()) == ZEL_BUSY && Clock::now() < giveUp) std::this_thread::yield();
   return status;
-}
-
-// Each of the six frames below meets a different action: drop (exact),
-// copy, pool tag, punt, L2 rewrite, GRE copy; anything else is accepted.
-Bytes EveryActionRules(uint8_t version) {
-  return rules::RulesetBuilder(version)
-      .Add(ExactRule("drop", "tcp", "10.0.0.1", 1000, "10.0.0.2", 80))
-      .Add("action=copy ipv4 proto=udp da=10.0.0.2")
-      .Add("action=pooltag pool=gold ipv4 proto=tcp da=10.9.0.5")
-      .Add("action=punt ipv4 proto=udp da=10.9.0.0-10.9.0.255")
-      .Add("action=l2rewrite rewrite=02:00:00:00:00:99 ipv4 proto=tcp da=10.7.7.7")
-      .Add("action=gre gre=198.51.100.7 snaplen=64 ipv4 proto=udp da=10.7.7.7")
-      .Bytes();
 }
 
 enum Kind { kPackets, kControl, kTreeReads, kSlowPathChurn, kRecreate, kSaves, kRestores, kKinds };
@@ -82,17 +68,10 @@ TEST_F(StressAllTest, EveryKindOfWorkAtOnceBalances) {
   host::FilterId ids[kSlots];
   auto newFilter = [&](size_t s) {
     ids[s] = NewFilter("stress" + std::to_string(s), 1);
-    EXPECT_EQ(Install(Filter(ids[s]), EveryActionRules(8)), ZEL_OK);
+    EXPECT_EQ(Install(Filter(ids[s]), EveryAction(8)), ZEL_OK);
   };
   for (size_t s = 0; s < kSlots; s++) newFilter(s);
-  std::vector<Bytes> frameSet;
-  for (const char* da : {"10.0.0.2", "10.9.0.5", "10.7.7.7"}) {
-    frames::FrameBuilder frame;
-    frame.Eth(frames::Mac(kGwMac), frames::Mac(kVmMac))
-        .Ipv4(frames::Ip4("10.0.0.1"), frames::Ip4(da));
-    frameSet.push_back(frames::FrameBuilder(frame).Tcp(1000, 80).Payload(40).Build());
-    frameSet.push_back(frame.Udp(53, 53).Build());
-  }
+  const std::vector<Bytes> frameSet = FramesForEveryAction();
   std::atomic<bool> stop{false};
   std::atomic<uint64_t> done[kKinds] = {};
   auto fail = [](const std::string& what) { ADD_FAILURE() << what; };
@@ -116,7 +95,7 @@ TEST_F(StressAllTest, EveryKindOfWorkAtOnceBalances) {
   auto control = [&](std::mt19937_64 rng) {
     for (int agents = 0; !stop; done[kControl]++) {
       const size_t s = rng() % kSlots;
-      const Bytes rs = EveryActionRules(rng() % 3 == 0 ? 7 : 8);
+      const Bytes rs = EveryAction(rng() % 3 == 0 ? 7 : 8);
       ZelStatus status = ZEL_OK;
       std::shared_lock hold(mu[s]);
       const uint64_t op = rng() % 5;
@@ -125,8 +104,9 @@ TEST_F(StressAllTest, EveryKindOfWorkAtOnceBalances) {
         case 1: host::Sluice::SendIoctl(ids[s], 9, controltest::Push(rs)); break;
         case 2: host::Sluice::SendIoctl(ids[s], 9, controltest::GetState()); break;
         case 3: {
-          // Rulesets are replaced, never added to: room for any of them.
-          Bytes tail(15 + 8 * 281, 0);
+          // Rulesets are replaced, never added to: room for any of them
+          // (13 rules and a mirrored half).
+          Bytes tail(15 + 16 * 281, 0);
           std::copy(rs.begin(), rs.end(), tail.begin());
           const Bytes req = controltest::DevRequest(
               rng() % 2 ? FWCharDevReqSetRuleset : FWCharDevReqGetRuleset,

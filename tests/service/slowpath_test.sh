@@ -1,10 +1,15 @@
 #!/usr/bin/env bash
-# A real slow path and a filter migrating between two sluice-host processes.
+# sluice-host on live traffic, a real slow path, and a filter migrating
+# between two sluice-host processes.
 #
 # Two copies of the live topology (scripts/live-topology.sh), each with its
 # own sluice-host: A in $P-fp, B in $Q-fp, with the same addresses, so that
 # the "VM" behind B stands for the VM once it has moved. Slow paths are
-# sluice-slowpath processes fed commands through a FIFO.
+# sluice-slowpath processes fed commands through a FIFO. Before any slow
+# path, A's port carries live traffic: rules changed with sluice-ctl while
+# it flows, GRE copies captured in $P-gre, DSCP marks and L2 rewrites seen
+# on the wire, the device channel, hostile rulesets. Ports are removed from
+# and added to running hosts, and pass traffic, in the migration part.
 #
 #   slowpath_test.sh SLUICE_HOST SLUICE_CTL SLUICE_SLOWPATH
 #
@@ -114,7 +119,7 @@ action=punt ipv4 proto=udp dport=5300
 EOF
 
 topo_up "$P" && topo_up "$Q" || { echo "FAIL could not make namespaces"; exit 1; }
-ip netns exec "$P-fp" "$HOST_BIN" --socket "$DIR/A.sock" --gre memory --max-seconds 100 \
+ip netns exec "$P-fp" "$HOST_BIN" --socket "$DIR/A.sock" --gre kernel --max-seconds 100 \
   --agent 'fw:default-action=ACTION_ACCEPT' \
   --port name=vm1,agent=fw,vm=vmside,switch=swside,uuid=564d-mig,vnic=1 2>"$DIR/A.log" &
 HOST_A=$!
@@ -127,6 +132,70 @@ for _ in $(seq 50); do ctl A hello >/dev/null 2>&1 && ctl B hello >/dev/null 2>&
 hello_both() { ctl A hello >/dev/null && ctl B hello >/dev/null; }
 check "both hosts answer" hello_both
 HEAP_B0=$(heap_of B)
+
+# --- live traffic on A: rules changed while it flows lose no accepted packet --
+set_rules() { printf '%s\n' "$@" | ctl A ruleset set vm1 - >/dev/null; }
+topo_recv_udp "$P-net" 5200 30 "$DIR/u5200"; sleep 0.3
+( send_udp "$P-vm" 10.77.0.2 5200 150 0.01 ) &
+SENDER=$!
+for i in $(seq 15); do
+  set_rules "action=accept ipv4 proto=udp dport=5200" "action=drop ipv4 proto=udp dport=$((6100 + i))"
+  set_rules "action=drop ipv4 proto=tcp dport=$((6200 + i))" "action=accept ipv4 proto=udp dport=5200"
+done
+wait $SENDER; sleep 0.5; kill $LAST_RECV 2>/dev/null; wait $LAST_RECV 2>/dev/null
+check "no accepted datagram lost across 30 rule changes" test "$(lines "$DIR/u5200")" -eq 150
+
+# GRE copies captured in a third namespace, marks and rewrites on the wire.
+set_rules "action=gre gre=10.78.0.2 snaplen=64 ipv4 proto=udp dport=5300" \
+  "action=dscp dscp=46 ipv4 proto=udp dport=5400" \
+  "action=l2rewrite rewrite=02:00:00:00:77:99 ipv4 proto=udp dport=5500"
+ip netns exec "$P-gre" timeout 10 tcpdump --immediate-mode -i g1 -U -w "$DIR/gre.pcap" proto gre 2>"$DIR/c1.err" &
+C1=$!
+ip netns exec "$P-net" timeout 10 tcpdump --immediate-mode -i eth0 -U -w "$DIR/net.pcap" udp 2>"$DIR/c2.err" &
+C2=$!
+for _ in $(seq 50); do  # capturing starts when tcpdump says it is listening
+  grep -q listening "$DIR/c1.err" && grep -q listening "$DIR/c2.err" && break
+  sleep 0.1
+done
+topo_send_udp "$P-vm" 10.77.0.2 5300 4 300
+send_udp "$P-vm" 10.77.0.2 5400 3
+send_udp "$P-net" 10.77.0.1 5500 3
+sleep 1  # frames still in the filter's receive ring, copies still in flight
+kill -INT $C1 $C2 2>/dev/null; wait $C1 $C2 2>/dev/null
+check "4 GRE copies captured" test "$(tcpdump -r "$DIR/gre.pcap" -nn 2>/dev/null | wc -l)" -eq 4
+# Outer IPv4 (20) + GRE (4) + the mirrored frame cut at 64 bytes.
+check "GRE copies carry the frame cut at the snap length" \
+  bash -c "tcpdump -r '$DIR/gre.pcap' -nn -v 2>/dev/null | grep -c 'length 88' | grep -qx 4"
+check "DSCP mark on the wire with a valid IPv4 checksum" \
+  bash -c "tcpdump -r '$DIR/net.pcap' -nn -v 'udp dst port 5400' 2>/dev/null | grep 'tos 0xb8' | grep -vc 'bad cksum' | grep -qx 3"
+check "L2 rewrite turns frames back toward the switch with the new MAC" \
+  bash -c "tcpdump -r '$DIR/net.pcap' -nn -e 'ether dst 02:00:00:00:77:99 and udp dst port 5500' 2>/dev/null | wc -l | grep -qx 3"
+
+# The device channel, by name and by VM UUID.
+printf 'action=drop ipv4 proto=udp dport=5600\n' >"$DIR/dev.rules"
+check "device set by uuid and vnic" ctl A dev set --uuid 564d-mig --vnic 1 "$DIR/dev.rules"
+check "device get by name shows it" bash -c "'$CTL_BIN' --socket '$DIR/A.sock' dev get --filter vm1 | grep -q 'dport=5600'"
+check "device test ioctl" ctl A dev test --filter vm1
+
+# Hostile rulesets on a live filter: refused, host up, heap unchanged.
+HEAP_A1=$(heap_of A)
+ctl A ruleset get vm1 --wire "$DIR/good.bin"
+python3 - "$DIR" <<'PY'
+import random, struct, sys
+d = sys.argv[1]
+good = open(d + "/good.bin", "rb").read()
+# header claims far more rules than follow; a header cut short; random bytes
+open(d + "/many.bin", "wb").write(good[:3] + struct.pack("<I", 0xFFFFFFFF) + good[7:])
+open(d + "/short.bin", "wb").write(good[:9])
+random.seed(9)
+open(d + "/noise.bin", "wb").write(bytes(random.randrange(256) for _ in range(700)))
+PY
+for f in many short noise; do
+  check "property refuses a $f ruleset" bash -c "! '$CTL_BIN' --socket '$DIR/A.sock' ruleset set vm1 --wire '$DIR/$f.bin' 2>/dev/null"
+  check "device refuses a $f ruleset" bash -c "! '$CTL_BIN' --socket '$DIR/A.sock' dev set --filter vm1 --wire '$DIR/$f.bin' 2>/dev/null"
+done
+check "the rules in force survive hostile rulesets" bash -c "'$CTL_BIN' --socket '$DIR/A.sock' ruleset get vm1 | grep -q 'dport=5600'"
+check "heap unchanged by hostile rulesets" test "$HEAP_A1" = "$(heap_of A)"
 
 # --- register, receive, answer, push ------------------------------------------
 start_sp a1 A --print --reissue --pcap "$DIR/a1.pcap"

@@ -1,5 +1,6 @@
-// Helpers for the migration tests: exact rules in the ruleset builder's
-// text, saved-state buffers and their header fields, and a fixture for the
+// Helpers for the migration and whole-module tests: exact rules in the
+// ruleset builder's text, a ruleset with every action and frames that meet
+// each, saved-state buffers and their header fields, and a fixture for the
 // module-side steps a test repeats (filters, slow paths, request policies).
 #pragma once
 
@@ -10,6 +11,7 @@
 #include "migration/migration.h"
 #include "module/locks.h"
 #include "tests/support/module_fixture.h"
+#include "tools/lib/frames.h"
 #include "tools/lib/ruleset_builder.h"
 
 namespace migsupport {
@@ -35,6 +37,46 @@ inline Bytes SampleRules(uint8_t version = 8) {
       .Bytes();
 }
 
+// Every action, exact and general rules; version 8 adds the QoS marks and
+// a resource-pool tag match (tag 7).
+inline Bytes EveryAction(uint8_t version = 8) {
+  rules::RulesetBuilder b(version);
+  b.Add("action=accept dir=both ipv4 proto=tcp sa=10.0.0.1 da=10.0.0.2 sport=1000 dport=80 bidir");
+  b.Add("action=drop dir=to ipv4 proto=udp sa=10.0.0.2 da=10.0.0.3 sport=53 dport=5353");
+  b.Add("action=copy ipv4 proto=udp dport=53");
+  b.Add("action=punt ipv6 proto=tcp dport=22");
+  b.Add("action=l2rewrite rewrite=02:00:00:00:00:99 ipv4 proto=tcp dport=8080");
+  b.Add("action=gre gre=198.51.100.7 snaplen=64 ipv4 proto=tcp dport=443");
+  b.Add("action=pooltag pool=gold ipv4 proto=udp dport=4789");
+  b.Add("action=log ipv4 proto=tcp dport=25");
+  if (version == 8) {
+    b.Add("action=accept rptag=7 ipv4 proto=tcp dport=9");
+    // An exact rule comparing the tag reads it on the exact lookup.
+    b.Add("action=accept rptag=7 exact dmac=02:00:00:00:00:02 smac=02:00:00:00:00:01 vlan=none "
+          "ipv4 proto=tcp sa=10.0.0.1 da=10.0.0.2 sport=1000 dport=7");
+    b.Add("action=dot1p dot1p=2 ipv4 proto=udp dport=7777");
+    b.Add("action=dscp+dot1p dscp=46 dot1p=5 ipv4 sa=10.0.0.0-10.0.0.255");
+  }
+  b.Add("action=drop ethtype=0x0806");
+  return b.Bytes();
+}
+// One frame for each rule of EveryAction() that a frame can meet.
+inline std::vector<Bytes> FramesForEveryAction() {
+  using frames::FrameBuilder, frames::Ip4, frames::Ip6, frames::Mac;
+  const auto a = Mac(kVmMac), b = Mac(kGwMac);
+  std::vector<Bytes> out;
+  for (uint16_t dport : {80, 443, 8080, 25, 9, 7}) {
+    out.push_back(FrameBuilder().Eth(b, a).Ipv4(Ip4("10.0.0.1"), Ip4("10.0.0.2")).Tcp(1000, dport)
+                      .Payload(20).Build());
+  }
+  for (uint16_t dport : {53, 5353, 4789, 7777}) {
+    out.push_back(FrameBuilder().Eth(b, a).Ipv4(Ip4("10.0.0.2"), Ip4("10.0.0.3")).Udp(53, dport)
+                      .Build());
+  }
+  out.push_back(FrameBuilder().Eth(b, a).Ipv6(Ip6("2001:db8::1"), Ip6("2001:db8::2")).Tcp(5, 22)
+                    .Build());
+  return out;
+}
 inline Bytes Pattern(size_t n, uint8_t first = 1) {
   Bytes b(n);
   for (size_t i = 0; i < n; i++) b[i] = static_cast<uint8_t>(first + i * 7);

@@ -6,8 +6,6 @@
 
 #include <tuple>
 
-#include "host/sluice/framework.h"
-#include "tests/support/module_fixture.h"
 #include "tests/support/tool_frames.h"
 #include "tools/lib/verdict_diff.h"
 
@@ -198,38 +196,6 @@ TEST(Diff, CaptureVerdictsComeFromTheModule) {
   bad.version = 9;
   EXPECT_FALSE(rules::DiffVerdicts(bad, b, capture, &got, &error));
   EXPECT_FALSE(error.empty());
-}
-
-// What the module hands back (exact rules first, mirrored halves added,
-// counters carried) decodes to text that compiles to the same bytes.
-class ModuleReadBack : public testsupport::ModuleTest {};
-
-TEST_F(ModuleReadBack, DecodedRulesetsCompileToTheBytesTheModuleWrote) {
-  const std::string tuple = kTuple;
-  const std::string texts[] = {
-      "ruleset version=8 features=drop-dhcp-server frag=punt\n"
-      "action=accept dir=to " + tuple + " sport=1000 dport=22 bidir pkts=3 bytes=180\n"
-      "action=drop " + tuple + " sport=1001 dport=22\n"
-      "action=drop dir=from " + tuple + " sport=1001 dport=22\n"
-      "action=punt dmac=!02:11:22:00:00:00/ff:ff:ff:00:00:00 sa=!2001:db8::/64 dport=!100-200\n"
-      "action=gre gre=192.0.2.1 snaplen=64 proto=udp rptag=4 bidir\n"
-      "default=drop\n",
-      "ruleset version=7 features=drop-bpdu\n"
-      "action=log dir=from " + tuple + " sport=7 dport=8 bidir\n"
-      "action=copy sa=10.0.0.0/8 proto=udp\n",
-  };
-  const host::FilterId id = CreateFilter();
-  const std::string prop = std::string(testsupport::kDefaultAgent) + ".ruleset";
-  for (const std::string& text : texts) {
-    ASSERT_EQ(host::Sluice::PropertyWrite(prop, id, rules::ParseRuleset(text)), ZEL_OK) << text;
-    std::vector<uint8_t> back;
-    ZelStatus status = ZEL_FAILURE;
-    ASSERT_TRUE(host::Sluice::PropertyRead(prop, id, &back, &status));
-    ASSERT_EQ(status, ZEL_OK);
-    const std::string decoded = rules::FormatRuleset(back);
-    EXPECT_EQ(rules::ParseRuleset(decoded), back) << decoded;
-    EXPECT_EQ(decoded.find("raw"), std::string::npos) << decoded;
-  }
 }
 
 }  // namespace
