@@ -411,7 +411,7 @@ class Bench {
     uint32_t most = 0;
     const FWClassifier* c = index->classifier;
     for (uint32_t i = 0; i < c->numNodes; i++) {
-      if (c->nodes[i].word == FW_CLS_LEAF && c->nodes[i].count > most) most = c->nodes[i].count;
+      if (c->nodes[i].word == FW_CLS_LEAF) most = std::max(most, FWClsLeafCount(c->nodes[i]));
     }
     return most;
   }

@@ -14,7 +14,7 @@ constexpr uint32_t kDimBits[FW_CLS_DIMS] = {32, 32, 16, 16, 8};
 constexpr uint32_t kMaxCutBits = 8;
 // Lists longer than this choose their cut on a sample of this many rules.
 constexpr uint32_t kSampleRules = 1024;
-// A node costs three leaf entries (12 bytes against 4).
+// A node costs two leaf entries (8 bytes against 4).
 constexpr uint64_t kNodeCost = sizeof(FWClsNode) / sizeof(uint32_t);
 
 // A rule's projection: inclusive intervals, numeric order.
@@ -161,7 +161,7 @@ struct Builder {
       zel_Memcpy(leaves.data + base, scratch.data + off, static_cast<size_t>(count) * 4);
     }
     leaves.size += count;
-    nodes.data[node] = FWClsNode{base, count, FW_CLS_LEAF, 0, 0};
+    nodes.data[node] = FWClsLeafNode(base, count);
     return true;
   }
 
@@ -316,7 +316,7 @@ struct Builder {
     const uint32_t childBase = nodes.size;
     nodes.size += children;
     const uint32_t shift = reg.width[d] - bestBits;
-    nodes.data[node] = FWClsNode{childBase, 0, kFWClsDimWord[d],
+    nodes.data[node] = FWClsNode{childBase, kFWClsDimWord[d],
                                  static_cast<uint8_t>(kFWClsDimShift[d] + shift),
                                  static_cast<uint16_t>(children - 1)};
 
@@ -452,7 +452,11 @@ Box* AllocBoxes(uint32_t count) {
 ZelStatus FWClassifierBuild(FWRuleEntry* const* entries, uint32_t count,
                             FWClassifier** classifier) {
   *classifier = nullptr;
-  if (count < g_fwClassifierTuning.minRules || count == 0) return ZEL_OK;
+  // Beyond FW_CLS_MAX_LEAF rules a leaf might not say its count; such
+  // rulesets (gigabytes of rules) are scanned in order.
+  if (count < g_fwClassifierTuning.minRules || count == 0 || count > FW_CLS_MAX_LEAF) {
+    return ZEL_OK;
+  }
   Box* boxes = AllocBoxes(count);
   if (boxes == nullptr) return ZEL_NO_MEMORY;
   for (uint32_t i = 0; i < count; i++) Project(entries[i]->rule, &boxes[i]);

@@ -43,15 +43,26 @@
 
 inline constexpr uint32_t FW_CLS_DIMS = 5;
 
+// Eight bytes, so that the levels of a descent below the shared top of
+// the tree are more often still cached. A leaf keeps its count in the
+// bytes an internal node keeps its cut in: up to FW_CLS_MAX_LEAF slots.
 struct FWClsNode {
   uint32_t base;   // internal: first child node; leaf: first slot number in leaves
-  uint32_t count;  // leaf: slot numbers listed
   uint8_t word;    // key word read (FWClsKey); FW_CLS_LEAF for a leaf
-  uint8_t shift;   // child = (word >> shift) & mask
-  uint16_t mask;
+  uint8_t shift;   // internal: child = (word >> shift) & mask; leaf: count bits 16-23
+  uint16_t mask;   // leaf: count bits 0-15
 };
-static_assert(sizeof(FWClsNode) == 12);
+static_assert(sizeof(FWClsNode) == 8);
 inline constexpr uint8_t FW_CLS_LEAF = 0xff;
+inline constexpr uint32_t FW_CLS_MAX_LEAF = 0xffffff;
+
+inline uint32_t FWClsLeafCount(const FWClsNode& n) {
+  return n.mask | (static_cast<uint32_t>(n.shift) << 16);
+}
+inline FWClsNode FWClsLeafNode(uint32_t base, uint32_t count) {
+  return FWClsNode{base, FW_CLS_LEAF, static_cast<uint8_t>(count >> 16),
+                   static_cast<uint16_t>(count)};
+}
 
 inline constexpr uint32_t FW_CLS_TREES = FW_CLS_DIMS;
 
@@ -75,7 +86,7 @@ struct FWClassifier {
 // a cut may copy a node's rules into its children at most spaceFactor
 // times over (children counted too), so that one cut never multiplies
 // memory; the tree holds at most budgetPerRule 4-byte words (leaf
-// entries; a node takes three) per rule. Rulesets of at most oneTreeRules
+// entries; a node takes two) per rule. Rulesets of at most oneTreeRules
 // rules put every rule the trees take in one tree: a lookup then descends
 // once and merges nothing (but the residual list), and the copies of rules
 // wide on the dimension cut stay affordable. Tests lower them to exercise
@@ -97,7 +108,8 @@ struct FWScanSlot;
 struct FWRuleEntry;
 
 // Builds the classifier of `count` slots (entries[i] belongs to slot i).
-// Null and ZEL_OK when the ruleset is too small to gain from one.
+// Null and ZEL_OK when the ruleset is too small to gain from one (or, past
+// FW_CLS_MAX_LEAF rules, too large for it).
 // ZEL_NO_MEMORY when an allocation fails; nothing is then allocated.
 [[nodiscard]] ZelStatus FWClassifierBuild(FWRuleEntry* const* entries, uint32_t count,
                                           FWClassifier** classifier);
@@ -124,6 +136,6 @@ inline const uint32_t* FWClassifierLeaf(const FWClassifier* c, uint32_t root,
   while (n->word != FW_CLS_LEAF) {
     n = &nodes[n->base + ((key.w[n->word] >> n->shift) & n->mask)];
   }
-  *count = n->count;
+  *count = FWClsLeafCount(*n);
   return c->leaves + n->base;
 }
