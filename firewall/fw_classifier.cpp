@@ -406,20 +406,35 @@ ZelStatus BuildFromBoxes(Box* boxes, uint32_t count, FWClassifier** classifier) 
     if (tree != nullptr) SLCGenericFree(tree);
 
     if (ok) {
+      const bool narrow = count <= FW_CLS_MAX_SLOTS16 && count <= t.maxRules16;
       const uint64_t bytes = sizeof(FWClassifier) + uint64_t{b.nodes.size} * sizeof(FWClsNode) +
-                             (uint64_t{b.leaves.size} + residual.size) * sizeof(uint32_t);
+                             (uint64_t{b.leaves.size} + residual.size) *
+                                 (narrow ? sizeof(uint16_t) : sizeof(uint32_t));
       void* block = bytes > UINT32_MAX ? nullptr : SLCGenericAlloc(static_cast<uint32_t>(bytes));
       if (block != nullptr) {
         auto* c = static_cast<FWClassifier*>(block);
         auto* nodes = reinterpret_cast<FWClsNode*>(c + 1);
-        auto* leaves = reinterpret_cast<uint32_t*>(nodes + b.nodes.size);
-        auto* rest = leaves + b.leaves.size;
         zel_Memcpy(nodes, b.nodes.data, static_cast<size_t>(b.nodes.size) * sizeof(FWClsNode));
-        if (b.leaves.size != 0) {
-          zel_Memcpy(leaves, b.leaves.data, static_cast<size_t>(b.leaves.size) * 4);
-        }
-        if (residual.size != 0) {
-          zel_Memcpy(rest, residual.data, static_cast<size_t>(residual.size) * 4);
+        c->leaves = c->residual = nullptr;
+        c->leaves16 = c->residual16 = nullptr;
+        if (narrow) {
+          auto* leaves = reinterpret_cast<uint16_t*>(nodes + b.nodes.size);
+          auto* rest = leaves + b.leaves.size;
+          for (uint32_t k = 0; k < b.leaves.size; k++) leaves[k] = static_cast<uint16_t>(b.leaves.data[k]);
+          for (uint32_t k = 0; k < residual.size; k++) rest[k] = static_cast<uint16_t>(residual.data[k]);
+          c->leaves16 = leaves;
+          c->residual16 = rest;
+        } else {
+          auto* leaves = reinterpret_cast<uint32_t*>(nodes + b.nodes.size);
+          auto* rest = leaves + b.leaves.size;
+          if (b.leaves.size != 0) {
+            zel_Memcpy(leaves, b.leaves.data, static_cast<size_t>(b.leaves.size) * 4);
+          }
+          if (residual.size != 0) {
+            zel_Memcpy(rest, residual.data, static_cast<size_t>(residual.size) * 4);
+          }
+          c->leaves = leaves;
+          c->residual = rest;
         }
         c->numTrees = numTrees;
         for (uint32_t t = 0; t < numTrees; t++) c->roots[t] = roots[t];
@@ -429,8 +444,6 @@ ZelStatus BuildFromBoxes(Box* boxes, uint32_t count, FWClassifier** classifier) 
         c->numResidual = residual.size;
         c->bytes = static_cast<uint32_t>(bytes);
         c->nodes = nodes;
-        c->leaves = leaves;
-        c->residual = rest;
         *classifier = c;
         status = ZEL_OK;
       }

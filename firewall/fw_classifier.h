@@ -75,9 +75,16 @@ struct FWClassifier {
   uint32_t numResidual;
   uint32_t bytes;          // the whole block, for accounting
   const FWClsNode* nodes;  // inside this block
-  const uint32_t* leaves;  // inside this block
-  const uint32_t* residual;  // inside this block
+  // Slot numbers, inside this block: 16-bit ones (leaves16, residual16)
+  // when numRules is at most FWClassifierTuning::maxRules16, which halves
+  // what a lookup reads and keeps cached; else 32-bit ones. The other pair
+  // is null.
+  const uint32_t* leaves;
+  const uint32_t* residual;
+  const uint16_t* leaves16;
+  const uint16_t* residual16;
 };
+inline constexpr uint32_t FW_CLS_MAX_SLOTS16 = 65536;  // slot numbers 0-65535
 
 // Build limits. Rulesets smaller than minRules are scanned in order; a
 // node with at most leafSize rules is a leaf (smallLeafSize, when not 0,
@@ -89,8 +96,10 @@ struct FWClassifier {
 // entries; a node takes two) per rule. Rulesets of at most oneTreeRules
 // rules put every rule the trees take in one tree: a lookup then descends
 // once and merges nothing (but the residual list), and the copies of rules
-// wide on the dimension cut stay affordable. Tests lower them to exercise
-// deep trees on small rulesets.
+// wide on the dimension cut stay affordable. Rulesets of at most
+// maxRules16 rules (never above FW_CLS_MAX_SLOTS16) list 16-bit slot
+// numbers. Tests lower them to exercise deep trees, and 32-bit slot
+// numbers, on small rulesets.
 struct FWClassifierTuning {
   uint32_t minRules;
   uint32_t leafSize;
@@ -100,9 +109,11 @@ struct FWClassifierTuning {
   uint32_t smallRules;
   uint32_t oneTreeRules;
   uint32_t spaceFactor;
+  uint32_t maxRules16;
 };
 extern FWClassifierTuning g_fwClassifierTuning;
-inline constexpr FWClassifierTuning kFWClassifierDefaults = {24, 16, 24, 256, 4, 4096, 16384, 12};
+inline constexpr FWClassifierTuning kFWClassifierDefaults = {24,   16,    24, 256, 4,
+                                                              4096, 16384, 12, FW_CLS_MAX_SLOTS16};
 
 struct FWScanSlot;
 struct FWRuleEntry;
@@ -127,15 +138,14 @@ struct FWClsKey {
 inline constexpr uint8_t kFWClsDimWord[FW_CLS_DIMS] = {1, 1, 0, 0, 0};
 inline constexpr uint8_t kFWClsDimShift[FW_CLS_DIMS] = {32, 0, 16, 0, 32};
 
-// The leaf of `key` in the tree rooted at node `root`: its first slot
-// number and count.
-inline const uint32_t* FWClassifierLeaf(const FWClassifier* c, uint32_t root,
-                                        const FWClsKey& key, uint32_t* count) {
+// The leaf node of `key` in the tree rooted at node `root`: its slot
+// numbers start at `base` in leaves or leaves16, FWClsLeafCount of them.
+inline const FWClsNode* FWClassifierLeaf(const FWClassifier* c, uint32_t root,
+                                         const FWClsKey& key) {
   const FWClsNode* nodes = c->nodes;
   const FWClsNode* n = nodes + root;
   while (n->word != FW_CLS_LEAF) {
     n = &nodes[n->base + ((key.w[n->word] >> n->shift) & n->mask)];
   }
-  *count = FWClsLeafCount(*n);
-  return c->leaves + n->base;
+  return n;
 }

@@ -304,6 +304,76 @@ inline FWPacketKey PacketKey(const FWPktSummary* summary, uint32_t presence, uin
   return k;
 }
 
+// The classifier's part of the keyed lookup, over its slot numbers of type
+// Index.
+template <typename Index, typename Miss, typename Accept, typename Slot>
+__attribute__((always_inline)) inline FWRuleEntry* FWFindInLeaves(
+    const FWClassifier* cls, const FWClsKey& key, const Index* leaves, const Index* residual,
+    Miss& miss, Accept& accept, const Slot* slots, FWRuleEntry* const* entries) {
+  // The leaf of every tree and the residual list, merged in ascending
+  // slot order: the first slot that passes its test is the first match
+  // of the whole scan, reached through the same full tests. A slot is
+  // in one list only.
+  if (cls->numTrees == 1 && cls->numResidual == 0) {  // one leaf: nothing to merge
+    const FWClsNode* node = FWClassifierLeaf(cls, cls->roots[0], key);
+    const Index* leaf = leaves + node->base;
+    for (const Index* end = leaf + FWClsLeafCount(*node); leaf != end; leaf++) {
+      if (miss(slots[*leaf]) == 0 && accept(*leaf)) return entries[*leaf];
+    }
+    return nullptr;
+  }
+  const Index* list[FW_CLS_TREES + 1];
+  const Index* end[FW_CLS_TREES + 1];
+  uint32_t lists = 0;
+  for (uint32_t t = 0; t < cls->numTrees; t++) {
+    const FWClsNode* node = FWClassifierLeaf(cls, cls->roots[t], key);
+    const uint32_t n = FWClsLeafCount(*node);
+    const Index* leaf = leaves + node->base;
+    list[lists] = leaf;
+    end[lists] = leaf + n;
+    lists += n != 0;
+  }
+  if (cls->numResidual != 0) {
+    list[lists] = residual;
+    end[lists++] = residual + cls->numResidual;
+  }
+  // More than two lists: the smallest head first, until two are left.
+  while (lists > 2) {
+    uint32_t best = 0;
+    for (uint32_t j = 1; j < lists; j++) {
+      if (*list[j] < *list[best]) best = j;
+    }
+    const uint32_t i = *list[best]++;
+    if (list[best] == end[best]) {  // exhausted: the last list takes its place
+      lists--;
+      list[best] = list[lists];
+      end[best] = end[lists];
+    }
+    if (miss(slots[i]) == 0 && accept(i)) return entries[i];
+  }
+  if (lists == 0) return nullptr;
+  const Index* a = list[0];
+  const Index* aEnd = end[0];
+  if (lists == 2) {
+    const Index* b = list[1];
+    const Index* bEnd = end[1];
+    for (;;) {
+      const uint32_t i = *a < *b ? *a++ : *b++;
+      if (miss(slots[i]) == 0 && accept(i)) return entries[i];
+      if (a == aEnd) {
+        a = b;
+        aEnd = bEnd;
+        break;
+      }
+      if (b == bEnd) break;
+    }
+  }
+  for (; a != aEnd; a++) {
+    if (miss(slots[*a]) == 0 && accept(*a)) return entries[*a];
+  }
+  return nullptr;
+}
+
 template <bool kL2>
 struct FWSlotOf {
   using Type = FWScanSlot;
@@ -351,68 +421,11 @@ FWRuleEntry* FWFindKeyed(const FWScanIndex* index, const FWPktSummary* summary,
   };
 
   if (const FWClassifier* cls = index->classifier; cls != nullptr) {
-    // The leaf of every tree and the residual list, merged in ascending
-    // slot order: the first slot that passes its test is the first match
-    // of the whole scan, reached through the same full tests. A slot is
-    // in one list only.
-    const FWClsKey& key = k.cls;
-    if (cls->numTrees == 1 && cls->numResidual == 0) {  // one leaf: nothing to merge
-      uint32_t n;
-      const uint32_t* leaf = FWClassifierLeaf(cls, cls->roots[0], key, &n);
-      for (const uint32_t* end = leaf + n; leaf != end; leaf++) {
-        if (miss(slots[*leaf]) == 0 && accept(*leaf)) return entries[*leaf];
-      }
-      return nullptr;
-    }
-    const uint32_t* list[FW_CLS_TREES + 1];
-    const uint32_t* end[FW_CLS_TREES + 1];
-    uint32_t lists = 0;
-    for (uint32_t t = 0; t < cls->numTrees; t++) {
-      uint32_t n;
-      const uint32_t* leaf = FWClassifierLeaf(cls, cls->roots[t], key, &n);
-      list[lists] = leaf;
-      end[lists] = leaf + n;
-      lists += n != 0;
-    }
-    if (cls->numResidual != 0) {
-      list[lists] = cls->residual;
-      end[lists++] = cls->residual + cls->numResidual;
-    }
-    // More than two lists: the smallest head first, until two are left.
-    while (lists > 2) {
-      uint32_t best = 0;
-      for (uint32_t j = 1; j < lists; j++) {
-        if (*list[j] < *list[best]) best = j;
-      }
-      const uint32_t i = *list[best]++;
-      if (list[best] == end[best]) {  // exhausted: the last list takes its place
-        lists--;
-        list[best] = list[lists];
-        end[best] = end[lists];
-      }
-      if (miss(slots[i]) == 0 && accept(i)) return entries[i];
-    }
-    if (lists == 0) return nullptr;
-    const uint32_t* a = list[0];
-    const uint32_t* aEnd = end[0];
-    if (lists == 2) {
-      const uint32_t* b = list[1];
-      const uint32_t* bEnd = end[1];
-      for (;;) {
-        const uint32_t i = *a < *b ? *a++ : *b++;
-        if (miss(slots[i]) == 0 && accept(i)) return entries[i];
-        if (a == aEnd) {
-          a = b;
-          aEnd = bEnd;
-          break;
-        }
-        if (b == bEnd) break;
-      }
-    }
-    for (; a != aEnd; a++) {
-      if (miss(slots[*a]) == 0 && accept(*a)) return entries[*a];
-    }
-    return nullptr;
+    return cls->leaves16 != nullptr
+               ? FWFindInLeaves(cls, k.cls, cls->leaves16, cls->residual16, miss, accept, slots,
+                                entries)
+               : FWFindInLeaves(cls, k.cls, cls->leaves, cls->residual, miss, accept, slots,
+                                entries);
   }
 
   // Two slots per iteration and one branch for both while neither passes;

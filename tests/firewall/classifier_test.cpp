@@ -320,10 +320,11 @@ TEST_F(ClassifierTest, SameRuleAsTheOrderedScanForEveryPacket) {
   for (uint32_t iter = 0; iter < 400; iter++) {
     Gen gen(0xc1a55000u + iter);
     // Leaves of 1 to 8 rules, now and then a budget that stops the cutting
-    // early; one tree or a tree per separating field.
+    // early; one tree or a tree per separating field; 16- or 32-bit slot
+    // numbers.
     g_fwClassifierTuning = {1, 1 + gen.U(8), 1 + gen.U(24), gen.P(20) ? 1u + gen.U(4) : 64u,
                             gen.P(30) ? 1u + gen.U(4) : 0u, 150, gen.P(50) ? 1000u : 0u,
-                            gen.P(50) ? 2u + gen.U(3) : 16u};
+                            gen.P(50) ? 2u + gen.U(3) : 16u, gen.P(70) ? 65536u : 0u};
     // Now and then no rule compares an L2 field, so the lookup leaves the
     // L2 key words out.
     gen.l2Percent = gen.P(30) ? 0 : 10;
@@ -398,7 +399,7 @@ TEST_F(ClassifierTest, SameRuleAsTheOrderedScanForEveryPacket) {
 // often hold the same rules (and share a subtree): every cut boundary and
 // every range end is met, which packets drawn at random seldom do.
 TEST_F(ClassifierTest, EveryDestinationPortAgainstTheOrderedScan) {
-  g_fwClassifierTuning = {1, 1, 24, 256, 0, 0, 0, 4};
+  g_fwClassifierTuning = {1, 1, 24, 256, 0, 0, 0, 4, 65536};
   uint64_t differing = 0;
   for (uint32_t seed = 0; seed < 12; seed++) {
     Gen gen(0x9047u + seed);
@@ -518,7 +519,7 @@ TEST_F(ClassifierTest, AllocationFailureAnywhereInTheBuildChangesNothing) {
        }},
   };
   for (const Road& road : roads) {
-    g_fwClassifierTuning = {1, 2, 24, 64, 0, 0, road.oneTreeRules, 4};
+    g_fwClassifierTuning = {1, 2, 24, 64, 0, 0, road.oneTreeRules, 4, 65536};
     ASSERT_EQ(Apply(first.Bytes(), true, road.fromIoctl), ZEL_OK) << road.name;
     const uint64_t heapBlocks = Capture().heapBlocks;
     const uint64_t failures = FailEachAllocation(road.name, [&] {
