@@ -240,17 +240,19 @@ __attribute__((always_inline)) inline uint64_t FWTupleFromSummary(
 }
 
 inline void FWDropCurrent(FWWalk* walk) {
+  FWIterCatchUp(walk);
   ZelPkt* removed = nullptr;
   zel_PktListIterRemovePkt(walk->iter, &removed);
   zel_PktRelease(removed);
 }
 
-// Carries out `action` on the walk's current packet and leaves the
-// iterator on the next packet. `entry` is null for verdicts that come with
+// Carries out `action` on the walk's current packet (the iterator caught
+// up first) and leaves the iterator on the next packet. `entry` is null for verdicts that come with
 // no rule (features, fragment override); the caller has mapped actions that
 // need rule parameters to a pass in that case.
 void FWApplyAction(FWWalk* walk, ZelPkt* pkt, uint32_t action, FWRuleEntry* entry,
                    const FWPktSummary* summary) {
+  FWIterCatchUp(walk);
   switch (action) {
     case SLCGenericActionDrop:
       FWDropCurrent(walk);
@@ -486,8 +488,9 @@ __attribute__((no_sanitize("thread"))) inline void FWCountHit(FWRuleEntry* entry
   entry->rule.byteCount += frameLen;
 }
 
-// Decides the packet of `cur`, which the main iterator stands on, and
-// leaves the iterator on the next packet. `early` tells that the ruleset has
+// Decides the packet of `cur`. The main iterator stands on it once caught
+// up (FWWalk::lag); afterwards it stands on the next packet, or lags
+// behind it. `early` tells that the ruleset has
 // feature bits or a fragment override, which may decide before the lookup.
 __attribute__((always_inline)) inline void FWDecide(FWWalk* walk, FWParsedPkt* cur, bool early,
                                                     bool haveGeneralRules) {
@@ -520,13 +523,13 @@ __attribute__((always_inline)) inline void FWDecide(FWWalk* walk, FWParsedPkt* c
     entry = FWFindRuleForPacket(walk->filter, pkt, direction, summary);
   }
   if (entry == nullptr) {
-    zel_PktListIterMove(walk->iter);
+    walk->lag++;
     return;
   }
   FWCountHit(entry, cur->frameLen);
   const uint32_t action = entry->rule.action;
   if (action == SLCGenericActionAccept) {  // the common verdict, without the dispatch
-    zel_PktListIterMove(walk->iter);
+    walk->lag++;
     return;
   }
   FWApplyAction(walk, pkt, action, entry, summary);

@@ -21,9 +21,19 @@ struct FWWalk {
   uint32_t direction;
   uint32_t spAttachState;   // ctx->spAttachState, read once under the hold
   uint32_t failurePolicy;   // filter->failurePolicy
+  // Packets the iterator still has to step over: those that stay in the
+  // list unchanged (no rule, Accept) are passed lazily, so that the common
+  // verdict costs no step; FWIterCatchUp brings the iterator onto the
+  // current packet before anything uses it.
+  uint32_t lag;
   bool slowPathUsed;        // something was appended to slowPathList
   bool reissueUsed;         // something was appended to reissueList
 };
+
+// Steps the walk's iterator onto the packet being decided.
+inline void FWIterCatchUp(FWWalk* walk) {
+  for (; walk->lag != 0; walk->lag--) zel_PktListIterMove(walk->iter);
+}
 
 inline constexpr uint32_t FW_ETH_MIN_PARSED = 26;  // shortest frame the parse reads
 inline constexpr uint16_t FW_ETHTYPE_IPV4 = 0x0800;
