@@ -229,30 +229,40 @@ struct Builder {
       return MakeLeaf(node, off, count);
     }
     // The cut that leaves the smallest largest child within the space
-    // factor; fewer copies break ties. Large lists are judged on a sample;
-    // the cut taken is then counted exactly.
+    // factor; fewer copies break ties between dimensions. Large lists are
+    // judged on a sample; the cut taken is then counted exactly.
     const uint32_t stride = count > kSampleRules ? count / kSampleRules : 1;
     uint32_t bestDim = FW_CLS_DIMS, bestBits = 0;
     uint64_t bestLargest = count, bestCopies = 0;
-    // A cut into more than three children per rule breaks the space
-    // factor (every rule is copied at least once): no finer spans needed.
+    // Cuts into more than about four children per rule are not tried.
     const uint32_t countBits = 33 - static_cast<uint32_t>(__builtin_clz(count));
     const uint32_t bitsCap = countBits < kMaxCutBits ? countBits : kMaxCutBits;
     for (uint32_t d = 0; d < FW_CLS_DIMS; d++) {
       const uint32_t maxBits = reg.width[d] < bitsCap ? reg.width[d] : bitsCap;
       if (maxBits == 0) continue;
       const uint32_t sampled = Spans(off, count, stride, reg, d, maxBits);
-      for (uint32_t bits = 1; bits <= maxBits; bits++) {
-        uint64_t largest, copies;
-        Evaluate(sampled, count, bits, maxBits - bits, &largest, &copies);
-        if (copies + (1u << bits) > uint64_t{t.spaceFactor} * count && bits > 1) break;
-        if (largest < bestLargest || (largest == bestLargest && bestDim != FW_CLS_DIMS &&
-                                      copies < bestCopies)) {
-          bestDim = d;
-          bestBits = bits;
-          bestLargest = largest;
-          bestCopies = copies;
+      // The finest cut within the space factor (1 bit at least): a finer
+      // cut copies at least as much and never leaves a larger largest
+      // child, so a bisection finds the dimension's best.
+      uint32_t lo = 1, hi = maxBits, bits = 0;
+      uint64_t largest = 0, copies = 0;
+      while (lo <= hi) {
+        const uint32_t mid = (lo + hi) / 2;
+        uint64_t l, c;
+        Evaluate(sampled, count, mid, maxBits - mid, &l, &c);
+        if (c + (1u << mid) <= uint64_t{t.spaceFactor} * count || mid == 1) {
+          bits = mid, largest = l, copies = c;
+          lo = mid + 1;
+        } else {
+          hi = mid - 1;
         }
+      }
+      if (largest < bestLargest || (largest == bestLargest && bestDim != FW_CLS_DIMS &&
+                                    copies < bestCopies)) {
+        bestDim = d;
+        bestBits = bits;
+        bestLargest = largest;
+        bestCopies = copies;
       }
     }
     if (bestDim == FW_CLS_DIMS) return MakeLeaf(node, off, count);
