@@ -69,8 +69,8 @@ struct FWScanIndex {
 
 // Key word 0: ports (numeric) and protocol, presence bits 0-9, the family
 // and direction bits, and two bits that only rules use. Ports and protocol
-// sit as a big-endian load of the summary's ipProto, sPort, dPort puts
-// them, so the packet's side is one load, one swap and one shift.
+// sit where a big-endian load of the summary's ipProto, sPort and dPort
+// puts them, so the packet's side is one load, one swap and one shift.
 inline constexpr uint32_t FW_KEY0_DPORT_SHIFT = 0;   // 16 bits, numeric
 inline constexpr uint32_t FW_KEY0_SPORT_SHIFT = 16;  // 16 bits, numeric
 inline constexpr uint32_t FW_KEY0_PROTO_SHIFT = 32;  // 8 bits
