@@ -268,33 +268,25 @@ struct Builder {
     if (bestDim == FW_CLS_DIMS) return MakeLeaf(node, off, count);
     const uint32_t d = bestDim;
 
-    // Each child's rules, counted exactly: the starts of the children's
-    // lists (relative to `fill`) go on the offsets stack. Only a cut whose
-    // every child holds fewer rules than this node is taken (sibling
-    // subtrees are shared on that ground, below), within the space factor
-    // and the budget. The sample may have misjudged the cut: coarser cuts
-    // of the same dimension are tried before the node gives up.
+    // Each child's rules, counted exactly: every rule's span at the chosen
+    // cut, then the same evaluation as the sample's. The starts of the
+    // children's lists (relative to `fill`) go on the offsets stack. Only
+    // a cut whose every child holds fewer rules than this node is taken
+    // (sibling subtrees are shared on that ground, below), within the
+    // space factor and the budget. The sample may have misjudged the cut:
+    // coarser cuts of the same dimension are tried before the node gives
+    // up.
     const uint32_t at = offsets.size;
     if (!offsets.Reserve(uint64_t{at} + (1u << bestBits) + 1)) return false;
+    const uint32_t spanBits = bestBits;
+    Spans(off, count, 1, reg, d, spanBits);
     uint32_t* c = counts.data;
     uint32_t children = 0;
     uint64_t copies = 0;
     for (;; bestBits--) {
+      uint64_t largest;
+      Evaluate(count, count, bestBits, spanBits - bestBits, &largest, &copies);
       children = 1u << bestBits;
-      zel_Memset(c, 0, (children + 1) * sizeof(uint32_t));
-      copies = 0;
-      for (uint32_t k = 0; k < count; k++) {
-        uint32_t first, last;
-        ChildSpan(scratch.data[off + k], reg, d, bestBits, &first, &last);
-        c[first]++;
-        c[last + 1]--;
-        copies += last - first + 1;
-      }
-      uint32_t running = 0, largest = 0;
-      for (uint32_t j = 0; j < children; j++) {
-        running += c[j];
-        if (running > largest) largest = running;
-      }
       if (largest < count && (copies + children <= uint64_t{t.spaceFactor} * count || bestBits == 1) &&
           children * kNodeCost + copies <= budget) {
         break;
@@ -316,10 +308,10 @@ struct Builder {
     }
     offsets.size = at + children + 1;
     scratch.size = fill + static_cast<uint32_t>(copies);
+    const uint32_t spanShift = spanBits - bestBits;
     for (uint32_t k = 0; k < count; k++) {
       const uint32_t i = scratch.data[off + k];
-      uint32_t first, last;
-      ChildSpan(i, reg, d, bestBits, &first, &last);
+      const uint32_t first = spans.data[2 * k] >> spanShift, last = spans.data[2 * k + 1] >> spanShift;
       for (uint32_t j = first; j <= last; j++) scratch.data[fill + c[j]++] = i;
     }
 
