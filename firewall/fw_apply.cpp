@@ -656,18 +656,17 @@ void FWPopulateRuleset(FWFilterContext* ctx, FWRuleset* ruleset) {
 }
 
 void FWTakeRules(FWFilterContext* ctx, FWFilterContext* former) {
+  // A swap with no rules that keeps what a clear keeps (fragment override,
+  // version) and drops the feature bits.
   List_Init(&former->ruleList);
-  List_Append(&former->ruleList, &ctx->ruleList);
-  former->ruleHash = ctx->ruleHash;
-  former->scanIndex = ctx->scanIndex;
-  former->numRules = ctx->numRules;
-  former->fwFeatures = ctx->fwFeatures;
+  former->ruleHash = nullptr;
+  former->scanIndex = nullptr;
+  former->numRules = 0;
   former->generation = 0;
-  ctx->ruleHash = nullptr;
-  ctx->scanIndex = nullptr;
-  ctx->generation++;
-  ctx->numRules = 0;
-  ctx->fwFeatures = 0;
+  former->fragOverride = ctx->fragOverride;
+  former->version = ctx->version;
+  former->fwFeatures = 0;
+  FWSwapStaged(ctx, former);
 }
 
 void FWClearRules(FWFilterContext* ctx) {
