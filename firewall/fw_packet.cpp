@@ -322,9 +322,9 @@ void FWApplyAction(FWWalk* walk, ZelPkt* pkt, uint32_t action, FWRuleEntry* entr
 // the misses of several packets are overlapped instead of added up:
 //   - kParseAhead packets ahead, a packet is parsed into a ring slot, its
 //     tuple hashed and its bucket head prefetched;
-//   - kEntryAhead packets ahead, the bucket's oldest entry (where the probe
-//     starts) is prefetched, and kNextEntryAhead packets ahead the one
-//     after it when the oldest will not match;
+//   - kEntryAhead packets ahead, the entries at both ends of the bucket are
+//     prefetched: the oldest, where the probe starts, and the newest, which
+//     is the one after it in a bucket of two (see FWPrefetchEntry);
 //   - then the verdict runs on the parsed slot, with the main iterator on
 //     that packet.
 // Only the current packet is ever removed or replaced, and nothing is
@@ -340,19 +340,16 @@ template <bool kFar>
 struct FWPipelineDepth {
   static constexpr uint32_t kParseAhead = 16;
   static constexpr uint32_t kEntryAhead = 8;
-  static constexpr uint32_t kNextEntryAhead = 0;  // unused
 };
 template <>
 struct FWPipelineDepth<true> {
   static constexpr uint32_t kParseAhead = 24;
   static constexpr uint32_t kEntryAhead = 12;
-  static constexpr uint32_t kNextEntryAhead = 6;
 };
 static_assert((kRingSize & (kRingSize - 1)) == 0);
 static_assert(FWPipelineDepth<false>::kEntryAhead < FWPipelineDepth<false>::kParseAhead &&
               FWPipelineDepth<false>::kParseAhead < kRingSize);
-static_assert(FWPipelineDepth<true>::kNextEntryAhead < FWPipelineDepth<true>::kEntryAhead &&
-              FWPipelineDepth<true>::kEntryAhead < FWPipelineDepth<true>::kParseAhead &&
+static_assert(FWPipelineDepth<true>::kEntryAhead < FWPipelineDepth<true>::kParseAhead &&
               FWPipelineDepth<true>::kParseAhead < kRingSize);
 // Tables with at least this many buckets (a few thousand exact rules) take
 // the pipelined walk: their bucket heads and the entries behind them no
@@ -360,8 +357,8 @@ static_assert(FWPipelineDepth<true>::kNextEntryAhead < FWPipelineDepth<true>::kE
 // turn costs several times one that has them in flight.
 constexpr uint32_t kPipelineMinBuckets = 16384;
 // Tables with at least this many buckets (a quarter of a million exact
-// rules) also request buckets' second entries.
-constexpr uint32_t kNextEntryMinBuckets = 1u << 20;
+// rules) take the deeper pipeline.
+constexpr uint32_t kFarMinBuckets = 1u << 20;
 
 // The packets of a list in order, each handed out after its object and
 // the head of its frame were requested from memory. A list is linked
@@ -454,27 +451,19 @@ __attribute__((always_inline)) inline void FWPrefetchLines(const ListLinks* link
   __builtin_prefetch(e + 64);
 }
 
-// The first rule entry the exact probe will compare: its bucket's oldest.
+// The entries the exact probe may compare, as far as the bucket head tells
+// them: the oldest, where the probe starts, and the newest. At a quarter
+// load about one hit in eight is not its bucket's oldest entry, and almost
+// always the bucket's second of two, the newest; reaching it through the
+// oldest would cost a second miss after the first.
 __attribute__((always_inline)) inline void FWPrefetchEntry(const FWParsedPkt* slot) {
   const ListLinks* bucket = slot->bucket;
   if (bucket == nullptr) return;
   const ListLinks* oldest = bucket->prev;
-  if (oldest != bucket) FWPrefetchLines(oldest);
-}
-
-// The bucket's second entry, when the oldest (requested kEntryAhead -
-// kNextEntryAhead packets earlier) has another hash, so that the probe
-// will go on to it: about one packet in ten at a quarter load.
-__attribute__((always_inline)) inline void FWPrefetchNextEntry(const FWParsedPkt* slot) {
-  const ListLinks* bucket = slot->bucket;
-  if (bucket == nullptr) return;
-  const ListLinks* oldest = bucket->prev;
-  if (oldest == bucket ||
-      FWEntryFromLink(const_cast<ListLinks*>(oldest))->hash == static_cast<uint32_t>(slot->hash)) {
-    return;
-  }
-  const ListLinks* second = oldest->prev;
-  if (second != bucket) FWPrefetchLines(second);
+  if (oldest == bucket) return;
+  FWPrefetchLines(oldest);
+  const ListLinks* newest = bucket->next;
+  if (newest != oldest) FWPrefetchLines(newest);
 }
 
 // Rule counters are plain adds under the shared hold: walks on other
@@ -535,17 +524,13 @@ __attribute__((always_inline)) inline void FWDecide(FWWalk* walk, FWParsedPkt* c
   FWApplyAction(walk, pkt, action, entry, summary);
 }
 
-// The pipelined walk (see above). kNextEntry, for tables far beyond the
-// caches: the deeper pipeline, and a request for the second entry of
-// buckets whose oldest will not match, where that entry would be a miss;
-// in smaller tables it is cached anyway and the extra step only costs
-// instructions.
-template <bool kNextEntry>
+// The pipelined walk (see above). kFar: the deeper pipeline, for tables far
+// beyond the caches.
+template <bool kFar>
 void FWWalkPipelined(FWWalk* walk, FWLookahead* la, FWTableView table, uint32_t fragOverride,
                      bool early, bool haveGeneralRules) {
-  constexpr uint32_t kParseAhead = FWPipelineDepth<kNextEntry>::kParseAhead;
-  constexpr uint32_t kEntryAhead = FWPipelineDepth<kNextEntry>::kEntryAhead;
-  constexpr uint32_t kNextEntryAhead = FWPipelineDepth<kNextEntry>::kNextEntryAhead;
+  constexpr uint32_t kParseAhead = FWPipelineDepth<kFar>::kParseAhead;
+  constexpr uint32_t kEntryAhead = FWPipelineDepth<kFar>::kEntryAhead;
   FWParsedPkt ring[kRingSize];
   uint32_t parsed = 0;  // packets parsed so far
   uint32_t done = 0;    // packets given their verdict
@@ -563,11 +548,6 @@ void FWWalkPipelined(FWWalk* walk, FWLookahead* la, FWTableView table, uint32_t 
     }
     if (parsed - done > kEntryAhead) {
       FWPrefetchEntry(&ring[(done + kEntryAhead) & (kRingSize - 1)]);
-    }
-    if constexpr (kNextEntry) {
-      if (parsed - done > kNextEntryAhead) {
-        FWPrefetchNextEntry(&ring[(done + kNextEntryAhead) & (kRingSize - 1)]);
-      }
     }
     FWDecide(walk, &ring[done++ & (kRingSize - 1)], early, haveGeneralRules);
   }
@@ -600,7 +580,7 @@ void FWWalkList(FWWalk* walk, ZelPktList* list, ZelPktListIter* ahead) {
     return;
   }
 
-  if (ctx->ruleHash->numBuckets < kNextEntryMinBuckets) {
+  if (ctx->ruleHash->numBuckets < kFarMinBuckets) {
     FWWalkPipelined<false>(walk, &la, table, fragOverride, early, haveGeneralRules);
   } else {
     FWWalkPipelined<true>(walk, &la, table, fragOverride, early, haveGeneralRules);
