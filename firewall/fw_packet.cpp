@@ -343,8 +343,8 @@ void FWApplyAction(FWWalk* walk, ZelPkt* pkt, uint32_t action, FWRuleEntry* entr
 // inserted, so the iterator ahead and the parsed slots stay valid and the
 // main iterator reaches each slot's packet in order. Parsing a packet early
 // changes nothing: packets ahead are not touched by the current verdict.
-// A burst takes kBurst * 128 bytes of the walk's stack (slot and tuple):
-// 8 KiB for the longer one. Filling the tuple again for the verdict, from
+// A burst takes kBurst * 136 bytes of the walk's stack (slot, tuple and
+// bucket): 8.5 KiB for the longer one. Filling the tuple again for the verdict, from
 // the summary, would halve that at 2 ns a packet.
 constexpr uint32_t kNearBurst = 16;
 constexpr uint32_t kFarBurst = 64;
@@ -401,7 +401,7 @@ __attribute__((always_inline)) inline ZelPkt* FWLookaheadTake(FWLookahead* la) {
 
 struct FWParsedPkt {
   ZelPkt* pkt;
-  uint32_t hash;      // low 32 bits of the tuple hash, when it probes (FWProbes)
+  uint32_t hash;      // low 32 bits of the tuple hash, when it has a bucket
   uint32_t frameLen;
   FWPktSummary summary;
 };
@@ -415,22 +415,13 @@ struct FWTableView {
   bool probe;
 };
 
-// Whether the packet of `slot` is looked up in the exact table: only
-// packets with ports can equal an exact rule.
-__attribute__((always_inline)) inline bool FWProbes(const FWParsedPkt* slot, FWTableView table) {
-  return table.probe && (slot->summary.presence & FW_PKT_PORTS) != 0;
-}
-
-__attribute__((always_inline)) inline const ListLinks* FWBucketOf(FWTableView table,
-                                                                  uint32_t hash) {
-  return table.buckets + (hash & table.mask);
-}
-
-// Parses `pkt` into `slot`; a packet that probes also gets its tuple, in
-// `tuple`, and its hash.
-__attribute__((always_inline)) inline void FWParseInto(ZelPkt* pkt, FWParsedPkt* slot,
-                                                       FWRuleTuple* tuple, uint32_t fragOverride,
-                                                       FWTableView table) {
+// Parses `pkt` into `slot`. Returns the bucket of the exact table to probe,
+// or null: only packets with ports can equal an exact rule. A packet with a
+// bucket also gets its tuple, in `tuple`, and its hash.
+__attribute__((always_inline)) inline const ListLinks* FWParseInto(ZelPkt* pkt, FWParsedPkt* slot,
+                                                                   FWRuleTuple* tuple,
+                                                                   uint32_t fragOverride,
+                                                                   FWTableView table) {
   const uint32_t frameLen = zel_PktFrameLenGet(pkt);
   uint32_t mappedLen = zel_PktFrameMappedLenGet(pkt);
   if (mappedLen > frameLen) mappedLen = frameLen;
@@ -438,9 +429,10 @@ __attribute__((always_inline)) inline void FWParseInto(ZelPkt* pkt, FWParsedPkt*
                &slot->summary);
   slot->pkt = pkt;
   slot->frameLen = frameLen;
-  if (FWProbes(slot, table)) {
-    slot->hash = static_cast<uint32_t>(FWTupleFromSummary(&slot->summary, tuple));
-  }
+  if (!table.probe || (slot->summary.presence & FW_PKT_PORTS) == 0) return nullptr;
+  const uint32_t hash = static_cast<uint32_t>(FWTupleFromSummary(&slot->summary, tuple));
+  slot->hash = hash;
+  return table.buckets + (hash & table.mask);
 }
 
 // The two cache lines of a rule entry the exact probe reads: links, hash,
@@ -475,14 +467,15 @@ __attribute__((no_sanitize("thread"))) inline void FWCountHit(FWRuleEntry* entry
   entry->rule.byteCount += frameLen;
 }
 
-// Decides the packet of `cur`; `tuple` is its tuple when it probes the
-// exact table (FWProbes), else null. The main iterator stands on it once
-// caught up (FWWalk::lag); afterwards it stands on the next packet, or lags
-// behind it. `early` tells that the ruleset has feature bits or a fragment
-// override, which may decide before the lookup.
+// Decides the packet of `cur`, with its bucket and tuple from FWParseInto
+// (no exact probe when `bucket` is null). The main iterator stands on it
+// once caught up (FWWalk::lag); afterwards it stands on the next packet, or
+// lags behind it. `early` tells that the ruleset has feature bits or a
+// fragment override, which may decide before the lookup.
 __attribute__((always_inline)) inline void FWDecide(FWWalk* walk, const FWParsedPkt* cur,
-                                                    const FWRuleTuple* tuple, FWTableView table,
-                                                    bool early, bool haveGeneralRules) {
+                                                    const ListLinks* bucket,
+                                                    const FWRuleTuple* tuple, bool early,
+                                                    bool haveGeneralRules) {
   FWFilterContext* ctx = walk->ctx;
   ZelPkt* pkt = cur->pkt;
   const FWPktSummary* summary = &cur->summary;
@@ -502,10 +495,9 @@ __attribute__((always_inline)) inline void FWDecide(FWWalk* walk, const FWParsed
   }
 
   FWRuleEntry* entry = nullptr;
-  if (tuple != nullptr) {
-    // FWFindExactRule, with the hash found at parse time.
-    entry = FWExactAccepts(FWBucketFindEntry(FWBucketOf(table, cur->hash), tuple, cur->hash),
-                           direction, pkt);
+  if (bucket != nullptr) {
+    // FWFindExactRule, with the bucket found at parse time.
+    entry = FWExactAccepts(FWBucketFindEntry(bucket, tuple, cur->hash), direction, pkt);
   }
   if (entry == nullptr && haveGeneralRules) {
     entry = FWFindRuleForPacket(walk->filter, pkt, direction, summary);
@@ -523,32 +515,31 @@ __attribute__((always_inline)) inline void FWDecide(FWWalk* walk, const FWParsed
   FWApplyAction(walk, pkt, action, entry, summary);
 }
 
-// The staged walk (see above), in bursts of kBurst packets. A slot's tuple
-// is tuples[slot], written when the packet probes.
+// The staged walk (see above), in bursts of kBurst packets. Slot i's
+// bucket and tuple are buckets[i] and tuples[i].
 template <uint32_t kBurst>
 void FWWalkStaged(FWWalk* walk, FWLookahead* la, FWTableView table, uint32_t fragOverride,
                   bool early, bool haveGeneralRules) {
   FWParsedPkt burst[kBurst];
   FWRuleTuple tuples[kBurst];
+  const ListLinks* buckets[kBurst];
   uint32_t n;
   do {
     n = 0;
     while (n < kBurst) {
       ZelPkt* pkt = FWLookaheadTake(la);
       if (pkt == nullptr) break;
-      FWParseInto(pkt, &burst[n], &tuples[n], fragOverride, table);
+      buckets[n] = FWParseInto(pkt, &burst[n], &tuples[n], fragOverride, table);
       n++;
     }
     for (uint32_t i = 0; i < n; i++) {
-      if (FWProbes(&burst[i], table)) __builtin_prefetch(FWBucketOf(table, burst[i].hash));
+      if (buckets[i] != nullptr) __builtin_prefetch(buckets[i]);
     }
     for (uint32_t i = 0; i < n; i++) {
-      if (FWProbes(&burst[i], table)) FWPrefetchEntry(FWBucketOf(table, burst[i].hash));
+      if (buckets[i] != nullptr) FWPrefetchEntry(buckets[i]);
     }
     for (uint32_t i = 0; i < n; i++) {
-      const FWParsedPkt* cur = &burst[i];
-      FWDecide(walk, cur, FWProbes(cur, table) ? &tuples[i] : nullptr, table, early,
-               haveGeneralRules);
+      FWDecide(walk, &burst[i], buckets[i], &tuples[i], early, haveGeneralRules);
     }
   } while (n == kBurst);
 }
@@ -575,9 +566,8 @@ void FWWalkList(FWWalk* walk, ZelPktList* list, ZelPktListIter* ahead) {
     FWParsedPkt cur;
     FWRuleTuple tuple;
     while (ZelPkt* pkt = FWLookaheadTake(&la)) {
-      FWParseInto(pkt, &cur, &tuple, fragOverride, table);
-      FWDecide(walk, &cur, FWProbes(&cur, table) ? &tuple : nullptr, table, early,
-               haveGeneralRules);
+      const ListLinks* bucket = FWParseInto(pkt, &cur, &tuple, fragOverride, table);
+      FWDecide(walk, &cur, bucket, &tuple, early, haveGeneralRules);
     }
     return;
   }
