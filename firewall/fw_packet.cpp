@@ -336,12 +336,12 @@ void FWApplyAction(FWWalk* walk, ZelPkt* pkt, uint32_t action, FWRuleEntry* entr
 // (a common list length) for tables far beyond the shared cache, where
 // each burst waits twice for memory; 16 below, where the waits are short
 // and longer bursts lose their frames and entries from the first-level
-// cache. Below, the tuples are hashed in a pass after the parse: a tuple
-// hashed right after it is written is read back through the smaller stores
-// that just wrote it, which the processor cannot forward to the hash's
-// wider loads (18.5 ns a packet at 10,000 rules, against 17 hashed apart).
-// Beyond, the parse waits on the walk's reads anyway, and the hash is
-// better done in their shadow (about a nanosecond a packet).
+// cache. Bursts of 16 hash their tuples in a pass after the parse: a
+// tuple hashed right after it is written is read back through the smaller
+// stores that just wrote it, which the processor cannot forward to the
+// hash's wider loads (18.5 ns a packet at 10,000 rules, against 17 hashed
+// apart). Bursts of 64 hash in the parse, whose steps wait on the walk's
+// reads anyway (hashed apart, about a nanosecond a packet slower).
 // Only the current packet is ever removed or replaced, and nothing is
 // inserted, so the iterator ahead and the parsed slots stay valid and the
 // main iterator reaches each slot's packet in order. Parsing a packet early
