@@ -108,6 +108,16 @@ constexpr size_t kListLen = 64;
 constexpr size_t kPackets = 1 << 16;
 constexpr const char* kAgent = "sluice-generic-quelmar";
 
+// The counters of a timed run that handled kListLen packets an iteration
+// with a ruleset of state.range(0) rules.
+void ReportPerPacket(benchmark::State& state) {
+  const double items = static_cast<double>(state.iterations()) * kListLen;
+  state.SetItemsProcessed(static_cast<int64_t>(items));
+  state.counters["ns_per_pkt"] =
+      benchmark::Counter(items, benchmark::Counter::kIsRate | benchmark::Counter::kInvert);
+  state.counters["rules"] = static_cast<double>(state.range(0));
+}
+
 void PutNet32(uint8_t* p, uint32_t v) {
   p[0] = static_cast<uint8_t>(v >> 24);
   p[1] = static_cast<uint8_t>(v >> 16);
@@ -499,11 +509,7 @@ Bench& Use(uint32_t n, bool mixed, bool scanOnly = false) {
 void Timed(benchmark::State& state, bool mixed, bool scanOnly = false) {
   Bench& b = Use(static_cast<uint32_t>(state.range(0)), mixed, scanOnly);
   for (auto _ : state) b.RunOne();
-  const double items = static_cast<double>(state.iterations()) * kListLen;
-  state.SetItemsProcessed(static_cast<int64_t>(items));
-  state.counters["ns_per_pkt"] =
-      benchmark::Counter(items, benchmark::Counter::kIsRate | benchmark::Counter::kInvert);
-  state.counters["rules"] = static_cast<double>(state.range(0));
+  ReportPerPacket(state);
   state.counters["residual"] = b.ResidualRules();
   state.counters["longest_leaf"] = b.LongestLeaf();
 }
@@ -721,27 +727,15 @@ ExactBench& UseExact(uint32_t n) {
   return *exactBench;
 }
 
-void BM_ExactHits(benchmark::State& state) {
-  const uint32_t n = static_cast<uint32_t>(state.range(0));
-  ExactBench& b = UseExact(n);
-  for (auto _ : state) b.RunOne();
-  const double items = static_cast<double>(state.iterations()) * kListLen;
-  state.SetItemsProcessed(static_cast<int64_t>(items));
-  state.counters["ns_per_pkt"] =
-      benchmark::Counter(items, benchmark::Counter::kIsRate | benchmark::Counter::kInvert);
-  state.counters["rules"] = static_cast<double>(n);
+// `run` of the exact bench of state.range(0) rules, timed.
+void ExactTimed(benchmark::State& state, void (ExactBench::*run)()) {
+  ExactBench& b = UseExact(static_cast<uint32_t>(state.range(0)));
+  for (auto _ : state) (b.*run)();
+  ReportPerPacket(state);
 }
 
-void BM_ExactTableFloor(benchmark::State& state) {
-  const uint32_t n = static_cast<uint32_t>(state.range(0));
-  ExactBench& b = UseExact(n);
-  for (auto _ : state) b.FloorOne();
-  const double items = static_cast<double>(state.iterations()) * kListLen;
-  state.SetItemsProcessed(static_cast<int64_t>(items));
-  state.counters["ns_per_pkt"] =
-      benchmark::Counter(items, benchmark::Counter::kIsRate | benchmark::Counter::kInvert);
-  state.counters["rules"] = static_cast<double>(n);
-}
+void BM_ExactHits(benchmark::State& state) { ExactTimed(state, &ExactBench::RunOne); }
+void BM_ExactTableFloor(benchmark::State& state) { ExactTimed(state, &ExactBench::FloorOne); }
 
 void ReportHold(benchmark::State& state, const HoldResult& r) {
   state.counters["stall_ms"] = r.stallMs;
@@ -909,11 +903,7 @@ void PeerTimed(benchmark::State& state, enum rte_acl_classify_alg method) {
     return;
   }
   for (auto _ : state) peer->RunOne();
-  const double items = static_cast<double>(state.iterations()) * kListLen;
-  state.SetItemsProcessed(static_cast<int64_t>(items));
-  state.counters["ns_per_pkt"] =
-      benchmark::Counter(items, benchmark::Counter::kIsRate | benchmark::Counter::kInvert);
-  state.counters["rules"] = static_cast<double>(n);
+  ReportPerPacket(state);
   state.counters["build_ms"] = peer->buildMs_;
 }
 
@@ -975,11 +965,7 @@ void BM_PeerHashBulk(benchmark::State& state) {
     next += kListLen;
     if (next == kExactFrames) next = 0;
   }
-  const double items = static_cast<double>(state.iterations()) * kListLen;
-  state.SetItemsProcessed(static_cast<int64_t>(items));
-  state.counters["ns_per_pkt"] =
-      benchmark::Counter(items, benchmark::Counter::kIsRate | benchmark::Counter::kInvert);
-  state.counters["rules"] = static_cast<double>(n);
+  ReportPerPacket(state);
   rte_hash_free(h);
 }
 
