@@ -59,7 +59,7 @@ void FWFillTupleFromRule(const FWRule* rule, FWRuleTuple* tuple) {
 
 uint64_t FWCreateTupleFromRule(const FWRule* rule, FWRuleTuple* tuple) {
   FWFillTupleFromRule(rule, tuple);
-  return HashFunc_HashBytes(tuple->bytes, FWTupleHashedLen(tuple));
+  return FWTupleHash(tuple);
 }
 
 FWRuleEntry* FWHashFindEntry(const Hash_Table* table, const FWRuleTuple* tuple, uint64_t hash) {

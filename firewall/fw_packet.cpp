@@ -441,8 +441,7 @@ __attribute__((always_inline)) inline bool FWParseInto(ZelPkt* pkt, FWParsedPkt*
 __attribute__((always_inline)) inline const ListLinks* FWHashInto(FWParsedPkt* slot,
                                                                   const FWRuleTuple* tuple,
                                                                   FWTableView table) {
-  const uint32_t hash =
-      static_cast<uint32_t>(HashFunc_HashBytes(tuple->bytes, FWTupleHashedLen(tuple)));
+  const uint32_t hash = static_cast<uint32_t>(FWTupleHash(tuple));
   slot->hash = hash;
   return table.buckets + (hash & table.mask);
 }
@@ -652,7 +651,7 @@ void FWParsePacket(ZelPkt* pkt, uint32_t fragOverride, FWPktSummary* summary) {
 
 uint64_t FWPacketTuple(const FWPktSummary* summary, FWRuleTuple* tuple) {
   FWFillTupleFromSummary(summary, tuple);
-  return HashFunc_HashBytes(tuple->bytes, FWTupleHashedLen(tuple));
+  return FWTupleHash(tuple);
 }
 
 ZelStatus FWProcessDefaultAction(FWFilterContext* ctx, ZelPktList* list, uint32_t direction) {

@@ -32,6 +32,11 @@ inline uint32_t FWTupleHashedLen(const FWRuleTuple* tuple) {
   return tuple->isIPv4 ? FW_TUPLE_V4_HASHED : FW_TUPLE_V6_HASHED;
 }
 
+// The tuple's hash: the host's byte hash of its hashed bytes.
+inline uint64_t FWTupleHash(const FWRuleTuple* tuple) {
+  return HashFunc_HashBytes(tuple->bytes, FWTupleHashedLen(tuple));
+}
+
 inline FWRuleEntry* FWEntryFromLink(ListLinks* link) {
   return LIST_CONTAINER(link, FWRuleEntry, link);
 }
