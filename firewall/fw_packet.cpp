@@ -320,28 +320,30 @@ void FWApplyAction(FWWalk* walk, ZelPkt* pkt, uint32_t action, FWRuleEntry* entr
 //
 // Staged: for large tables, whose bucket and entry loads miss the caches,
 // the list goes in bursts, and each burst in stages over all its packets:
-//   1. each packet is taken and parsed into a slot, with its tuple, and
-//      the tuple is hashed;
-//   2. the bucket heads of the burst are requested;
-//   3. the entries they lead to are requested (FWPrefetchEntry);
+//   1. each packet is taken and parsed into a slot, with its tuple;
+//   2. each tuple is hashed and its bucket head requested at once;
+//   3. the entries the bucket heads lead to are requested
+//      (FWPrefetchEntry);
 //   4. each packet is decided, with the main iterator on it.
 // A stage's misses are all in flight before the next stage waits for the
 // first of them. The list itself is walked with no table miss in flight:
 // each step of it reads the packet object the step before found, and
-// table requests made during the walk (a ring that parsed packets ahead and
-// requested buckets and entries a few packets before their verdict, or
-// these stages overlapped from one burst to the next) slowed those steps
-// down more than they gained: at 1,000,000 exact rules the ring took 41 ns
-// a packet, overlapped bursts 43, these stages 32. Bursts are 64 packets
-// (a common list length) for tables far beyond the shared cache, where
-// each burst waits twice for memory; 16 below, where the waits are short
-// and longer bursts lose their frames and entries from the first-level
-// cache. Bursts of 16 hash their tuples in a pass after the parse: a
-// tuple hashed right after it is written is read back through the smaller
-// stores that just wrote it, which the processor cannot forward to the
-// hash's wider loads (18.5 ns a packet at 10,000 rules, against 17 hashed
-// apart). Bursts of 64 hash in the parse, whose steps wait on the walk's
-// reads anyway (hashed apart, about a nanosecond a packet slower).
+// table requests made during the walk slowed those steps down more than
+// they gained. At 1,000,000 exact rules a ring that parsed packets ahead
+// and requested buckets and entries a few packets before their verdict
+// took 41 ns a packet, these stages overlapped from one burst to the next
+// 43; with the list walked in a pass of its own, bucket requests made
+// during the parse took 57 against 43 without. The hash pass is the place
+// for them: its steps are short and read only the slot, so the requests
+// overlap it (31-32 ns against 32-35 when the bucket heads were requested
+// in a pass of their own after it). Hashing apart from the parse also
+// spares the hash a stall: a tuple hashed right after it is written is
+// read back through the smaller stores that just wrote it, which the
+// processor cannot forward to the hash's wider loads. Bursts are
+// 64 packets (a common list length) for tables far beyond the shared
+// cache, where each burst waits twice for memory; 16 below, where the
+// waits are short and longer bursts lose their frames and entries from
+// the first-level cache.
 // Only the current packet is ever removed or replaced, and nothing is
 // inserted, so the iterator ahead and the parsed slots stay valid and the
 // main iterator reaches each slot's packet in order. Parsing a packet early
@@ -527,9 +529,8 @@ __attribute__((always_inline)) inline void FWDecide(FWWalk* walk, const FWParsed
 }
 
 // The staged walk (see above), in bursts of kBurst packets. Slot i's
-// tuple and bucket are tuples[i] and buckets[i]. kHashApart: the tuples are
-// hashed in a pass of their own after the parse, else as each is made.
-template <uint32_t kBurst, bool kHashApart>
+// tuple and bucket are tuples[i] and buckets[i].
+template <uint32_t kBurst>
 void FWWalkStaged(FWWalk* walk, FWLookahead* la, FWTableView table, uint32_t fragOverride,
                   bool early, bool haveGeneralRules) {
   FWParsedPkt burst[kBurst];
@@ -543,17 +544,10 @@ void FWWalkStaged(FWWalk* walk, FWLookahead* la, FWTableView table, uint32_t fra
       ZelPkt* pkt = FWLookaheadTake(la);
       if (pkt == nullptr) break;
       probes[n] = FWParseInto(pkt, &burst[n], &tuples[n], fragOverride, table);
-      if constexpr (!kHashApart) {
-        buckets[n] = probes[n] ? FWHashInto(&burst[n], &tuples[n], table) : nullptr;
-      }
       n++;
     }
-    if constexpr (kHashApart) {
-      for (uint32_t i = 0; i < n; i++) {
-        buckets[i] = probes[i] ? FWHashInto(&burst[i], &tuples[i], table) : nullptr;
-      }
-    }
     for (uint32_t i = 0; i < n; i++) {
+      buckets[i] = probes[i] ? FWHashInto(&burst[i], &tuples[i], table) : nullptr;
       if (buckets[i] != nullptr) __builtin_prefetch(buckets[i]);
     }
     for (uint32_t i = 0; i < n; i++) {
@@ -596,9 +590,9 @@ void FWWalkList(FWWalk* walk, ZelPktList* list, ZelPktListIter* ahead) {
   }
 
   if (ctx->ruleHash->numBuckets < kFarMinBuckets) {
-    FWWalkStaged<kNearBurst, true>(walk, &la, table, fragOverride, early, haveGeneralRules);
+    FWWalkStaged<kNearBurst>(walk, &la, table, fragOverride, early, haveGeneralRules);
   } else {
-    FWWalkStaged<kFarBurst, false>(walk, &la, table, fragOverride, early, haveGeneralRules);
+    FWWalkStaged<kFarBurst>(walk, &la, table, fragOverride, early, haveGeneralRules);
   }
 }
 
