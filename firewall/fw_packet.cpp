@@ -336,16 +336,17 @@ void FWApplyAction(FWWalk* walk, ZelPkt* pkt, uint32_t action, FWRuleEntry* entr
 // burst to the next, 43; entries requested and packets decided between
 // the parse's chunks, 41-43; the stages as they are, 30-31.
 // Where the bucket requests go: hashing is a pass of its own, whose steps
-// are short and read only the slot, so the requests overlap it (31-32 ns
-// against 32-35 with the requests in a pass after it). A tuple hashed
-// right after it is written would be read back through the smaller stores
-// that just wrote it, which the processor cannot forward to the hash's
-// wider loads. And the parse goes by eight: a whole burst of 64 parsed
-// before any hashing outran the processor's own prefetch of the packet
-// blocks (timed packet by packet, the parse ran at its cache-hit pace for
-// the first 16 packets, then waited for memory); a hash pass after every
-// eight lets that prefetch catch up (parse and hash 50 timestamp cycles a
-// packet against 54; the walk 30.0-31.1 ns against 31.2-32.5).
+// are short and read only the slot, so the requests overlap it (with each
+// burst still parsed whole, 31-32 ns against 32-35 when the requests had a
+// pass of their own after the hashing). A tuple hashed right after it is
+// written would be read back through the smaller stores that just wrote it,
+// which the processor cannot forward to the hash's wider loads. And the
+// parse goes by eight: a whole burst of 64 parsed before any hashing outran
+// the processor's own prefetch of the packet blocks (timed packet by
+// packet, the parse ran at its cache-hit pace for the first 16 packets,
+// then waited for memory); a hash pass after every eight lets that prefetch
+// catch up (parse and hash 50 timestamp cycles a packet against 54; the
+// walk 30.0-31.1 ns against 31.2-32.5).
 // Bursts are 64 packets (a common list length) for tables far beyond the
 // shared cache, where each burst waits twice for memory; 16 below, where
 // the waits are short and longer bursts lose their frames and entries
